@@ -1,0 +1,63 @@
+// The package's run-time state: the service state file, the package's
+// enabled flag, the repository volume checks and the daemon's liveness.
+//
+// The state file "/var/packages/Plovo/etc/status" is shared by every web
+// server process and the copy daemon; all reads and writes hold an
+// exclusive flock on "status.lock" for one read or one write of both keys,
+// so "state" and "error" always travel as a pair. Every function may be
+// called from several threads and processes. The state files need root (or
+// the package's user) to open; callers raise privileges around them.
+#ifndef PLOVO_SERVICE_SERVICE_CTRL_H
+#define PLOVO_SERVICE_SERVICE_CTRL_H
+
+#include <string>
+
+#include "common/export.h"
+
+enum PLOVO_SERVICE_STATUS {
+  PLOVO_SERVICE_STATUS_UNKNOWN = 0,      // a fresh record, not yet read
+  PLOVO_SERVICE_STATUS_NO_REPO = 1,      // no volume can hold the repository
+  PLOVO_SERVICE_STATUS_INIT = 2,         // the service prepares its environment
+  PLOVO_SERVICE_STATUS_UPGRADING = 3,    // the database installer/updater runs
+  PLOVO_SERVICE_STATUS_RUNNING = 4,      // written by the daemon; all methods served
+  PLOVO_SERVICE_STATUS_MOVING_REPO = 5,  // the repository moves to another volume
+  PLOVO_SERVICE_STATUS_STOP = 6,         // stopped
+  PLOVO_SERVICE_STATUS_ERROR = 7,        // start or move failed; see `error`
+};
+
+// The pair kept in the status file. `state` holds a PLOVO_SERVICE_STATUS
+// value, or whatever number the file holds; `error` is a tag such as
+// "err_sys" or "err_upgrade_failed", empty when there is none.
+struct ServiceStatus {
+  ServiceStatus();
+  ~ServiceStatus();
+
+  int state;
+  std::string error;
+};
+
+// Reads both keys under the lock into status. Returns 0, or -1 when the lock
+// file cannot be opened or locked or either key cannot be read (a state read
+// before the failure stays in status.state).
+PLOVO_EXPORT int GetServiceStatus(ServiceStatus& status);
+
+// Writes both keys under the lock. Returns 0, or -1 when the lock cannot be
+// taken or a key cannot be written ("error" is not written after a failed
+// "state").
+PLOVO_EXPORT int SetServiceStatus(const ServiceStatus& status);
+
+// True when the package is enabled ("/var/packages/Plovo/enabled" exists).
+bool IsPkgEnable();
+
+// True when volumePath exists and the platform knows it as a mounted volume.
+bool IsRepoMounted(const std::string& volumePath);
+
+// True when volumePath is a mounted, writable, internal volume: one that may
+// hold the repository.
+bool IsRepoValid(const std::string& volumePath);
+
+// The daemon's liveness from "/var/run/plovod.pid": 0 alive, 1 pid file
+// present but the process gone, 3 no usable pid file.
+int StatusService();
+
+#endif

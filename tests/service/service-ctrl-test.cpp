@@ -1,0 +1,210 @@
+#include "service/service-ctrl.h"
+
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <syslog.h>
+#include <velt/dev.h>
+
+#include <string>
+
+#include "log-capture.h"
+#include "sandbox.h"
+
+namespace {
+
+using plovo_test::LogCapture;
+
+class ServiceStatusTest : public plovo_test::SandboxTest {
+ protected:
+  void SetUp() override {
+    SandboxTest::SetUp();
+    MakeDir("/var/packages/Plovo/etc");
+  }
+  static constexpr const char* kStatus = "/var/packages/Plovo/etc/status";
+};
+
+TEST_F(ServiceStatusTest, WrittenPairReadsBackAndKeepsOtherLines) {
+  WriteFile(kStatus, "owner=\"daemon\"\n");
+  ServiceStatus out;
+  out.state = PLOVO_SERVICE_STATUS_ERROR;
+  out.error = "err_upgrade_failed";
+  ASSERT_EQ(SetServiceStatus(out), 0);
+  EXPECT_EQ(ReadFile(kStatus), "owner=\"daemon\"\nstate=\"7\"\nerror=\"err_upgrade_failed\"\n");
+
+  out.state = PLOVO_SERVICE_STATUS_RUNNING;
+  out.error = "";
+  ASSERT_EQ(SetServiceStatus(out), 0);
+  EXPECT_EQ(ReadFile(kStatus), "owner=\"daemon\"\nstate=\"4\"\nerror=\"\"\n");
+
+  ServiceStatus in;
+  in.error = "stale";
+  ASSERT_EQ(GetServiceStatus(in), 0);
+  EXPECT_EQ(in.state, 4);
+  EXPECT_EQ(in.error, "");
+}
+
+TEST_F(ServiceStatusTest, OutOfRangeAndSignedStatesAreTakenAsTheyStand) {
+  WriteFile(kStatus, "state=\"42\"\nerror=\"x\"\n");
+  ServiceStatus in;
+  ASSERT_EQ(GetServiceStatus(in), 0);
+  EXPECT_EQ(in.state, 42);
+  WriteFile(kStatus, "state=\"-3\"\nerror=\"\"\n");
+  ASSERT_EQ(GetServiceStatus(in), 0);
+  EXPECT_EQ(in.state, -3);
+}
+
+TEST_F(ServiceStatusTest, ReadFailsWithoutErrorKeyButKeepsTheState) {
+  WriteFile(kStatus, "state=\"4\"\n");
+  LogCapture log;
+  ServiceStatus in;
+  EXPECT_EQ(GetServiceStatus(in), -1);
+  EXPECT_EQ(in.state, 4);
+  EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to get plovo service error state.")) << log.Dump();
+}
+
+TEST_F(ServiceStatusTest, ReadFailsWithoutStateOrFile) {
+  LogCapture log;
+  ServiceStatus in;
+  EXPECT_EQ(GetServiceStatus(in), -1);
+  EXPECT_TRUE(log.Contains("Failed to get plovo service state.")) << log.Dump();
+  WriteFile(kStatus, "error=\"\"\n");
+  EXPECT_EQ(GetServiceStatus(in), -1);
+  EXPECT_EQ(in.state, PLOVO_SERVICE_STATUS_UNKNOWN);
+}
+
+TEST_F(ServiceStatusTest, LockFileThatCannotBeCreatedFailsReadAndWrite) {
+  // A folder where the lock file belongs cannot be opened for writing, even
+  // by root.
+  MakeDir("/var/packages/Plovo/etc/status.lock");
+  WriteStatus(4, "");
+  LogCapture log;
+  ServiceStatus st;
+  EXPECT_EQ(GetServiceStatus(st), -1);
+  st.state = 6;
+  EXPECT_EQ(SetServiceStatus(st), -1);
+  EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to open plovo status lock file.")) << log.Dump();
+  EXPECT_EQ(ReadFile(kStatus), "state=\"4\"\nerror=\"\"\n");
+}
+
+TEST_F(ServiceStatusTest, LockFileIsCreatedReadOnly) {
+  ServiceStatus st;
+  st.state = 2;
+  ASSERT_EQ(SetServiceStatus(st), 0);
+  struct stat info {};
+  ASSERT_EQ(stat(Path("/var/packages/Plovo/etc/status.lock").c_str(), &info), 0);
+  EXPECT_EQ(info.st_mode & 0777, 0440u);
+}
+
+TEST_F(ServiceStatusTest, FailedStateWriteLeavesErrorUnwritten) {
+  WriteStatus(4, "");
+  VeltDevFailCall("VLIBCFileSetKeyValue", 1, 1, VLIBC_ERR_IO);
+  LogCapture log;
+  ServiceStatus st;
+  st.state = 7;
+  st.error = "err_sys";
+  EXPECT_EQ(SetServiceStatus(st), -1);
+  EXPECT_TRUE(log.Contains("Failed to set plovo service state to [7].")) << log.Dump();
+  EXPECT_EQ(ReadFile(kStatus), "state=\"4\"\nerror=\"\"\n");
+
+  VeltDevFailCall("VLIBCFileSetKeyValue", 2, 1, VLIBC_ERR_IO);
+  EXPECT_EQ(SetServiceStatus(st), -1);
+  EXPECT_TRUE(log.Contains("Failed to set plovo service error to [err_sys].")) << log.Dump();
+}
+
+TEST_F(ServiceStatusTest, ConcurrentWritersNeverMixTheirPairs) {
+  WriteStatus(2, "writer_2");
+  constexpr int kRounds = 500;
+  // Each writer process writes its own consistent pair while this process
+  // reads: without the lock a reader sees one writer's state with the
+  // other's error, and the file can be left holding a mixed pair.
+  auto writer = [](int state) {
+    ServiceStatus st;
+    st.state = state;
+    st.error = "writer_" + std::to_string(state);
+    for (int i = 0; i < kRounds; ++i) {
+      if (SetServiceStatus(st) != 0) _exit(2);
+    }
+    _exit(0);
+  };
+  pid_t children[2];
+  children[0] = fork();
+  if (children[0] == 0) writer(2);
+  children[1] = fork();
+  if (children[1] == 0) writer(3);
+
+  int mixed = 0;
+  int running = 2;
+  while (running > 0) {
+    ServiceStatus seen;
+    ASSERT_EQ(GetServiceStatus(seen), 0);
+    if (seen.error != "writer_" + std::to_string(seen.state)) ++mixed;
+    for (pid_t& child : children) {
+      int status = 0;
+      if (child > 0 && waitpid(child, &status, WNOHANG) == child) {
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+        child = -1;
+        --running;
+      }
+    }
+  }
+  EXPECT_EQ(mixed, 0);
+  ServiceStatus last;
+  ASSERT_EQ(GetServiceStatus(last), 0);
+  EXPECT_EQ(last.error, "writer_" + std::to_string(last.state));
+}
+
+using PackageStateTest = plovo_test::SandboxTest;
+
+TEST_F(PackageStateTest, PackageEnabledByItsFlagFile) {
+  EXPECT_FALSE(IsPkgEnable());
+  WriteFile("/var/packages/Plovo/enabled", "");
+  EXPECT_TRUE(IsPkgEnable());
+}
+
+TEST_F(PackageStateTest, RepositoryChecksTellUsbVolumesFromInternalOnes) {
+  MakeDir("/volume1");
+  MakeDir("/usb1");
+  MakeDir("/volume3");
+  DeclareVolumes({{"volume1"},
+                  {"usb1", true, true, "external"},
+                  {"volume2", false},
+                  {"volume3", true, false}});
+  LogCapture log;
+  EXPECT_TRUE(IsRepoMounted(Path("/volume1")));
+  EXPECT_TRUE(IsRepoValid(Path("/volume1")));
+
+  EXPECT_TRUE(IsRepoMounted(Path("/usb1")));
+  EXPECT_FALSE(IsRepoValid(Path("/usb1")));
+  EXPECT_TRUE(log.Contains("volume not internal (2)")) << log.Dump();
+
+  EXPECT_FALSE(IsRepoValid(Path("/volume3")));
+  EXPECT_TRUE(log.Contains("volume not mounted or writable")) << log.Dump();
+
+  EXPECT_FALSE(IsRepoMounted(Path("/volume2")));
+  EXPECT_TRUE(log.Contains("Repo volumn path not exist '" + Path("/volume2") + "'"));
+  MakeDir("/volume2");
+  EXPECT_FALSE(IsRepoMounted(Path("/volume2")));
+  EXPECT_TRUE(log.Contains("Plovo repo NOT mounted '" + Path("/volume2") + "'"));
+  EXPECT_FALSE(IsRepoValid(Path("/volume2")));
+
+  EXPECT_FALSE(IsRepoMounted(""));
+  EXPECT_FALSE(IsRepoValid(""));
+}
+
+TEST_F(PackageStateTest, DaemonLivenessFromPidFile) {
+  EXPECT_EQ(StatusService(), 3);
+  WriteFile("/var/run/plovod.pid", "garbage\n");
+  EXPECT_EQ(StatusService(), 3);
+
+  WriteFile("/var/run/plovod.pid", std::to_string(getpid()) + "\n");
+  EXPECT_EQ(StatusService(), 0);
+
+  pid_t child = fork();
+  if (child == 0) _exit(0);
+  ASSERT_EQ(waitpid(child, nullptr, 0), child);
+  WriteFile("/var/run/plovod.pid", std::to_string(child) + "\n");
+  EXPECT_EQ(StatusService(), 1);
+}
+
+}  // namespace

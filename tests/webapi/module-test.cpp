@@ -1,0 +1,143 @@
+// The built module as the web server loads it, and plovo-api on top of it.
+#include <dlfcn.h>
+#include <velt/webapi.h>
+
+#include <array>
+#include <cstdio>
+#include <cstring>
+#include <memory>
+#include <set>
+#include <string>
+#include <sys/wait.h>
+
+#include "sandbox.h"
+
+namespace {
+
+struct CommandResult {
+  int status = -1;
+  std::string out;
+};
+
+CommandResult RunCommand(const std::string& command) {
+  CommandResult result;
+  FILE* pipe = popen(command.c_str(), "r");
+  if (pipe == nullptr) return result;
+  std::array<char, 4096> buffer;
+  size_t n;
+  while ((n = fread(buffer.data(), 1, buffer.size(), pipe)) > 0) result.out.append(buffer.data(), n);
+  int status = pclose(pipe);
+  result.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  return result;
+}
+
+class ModuleTest : public plovo_test::SandboxTest {};
+
+TEST_F(ModuleTest, TableListsFifteenMethodsServedByProcess) {
+  void* module = dlopen(PLOVO_MODULE_PATH, RTLD_NOW | RTLD_LOCAL);
+  ASSERT_NE(module, nullptr) << dlerror();
+  auto getTable = reinterpret_cast<const VELT::APIDesc* (*)()>(dlsym(module, "GetAPITable"));
+  auto process = reinterpret_cast<VELT::APIHandler>(dlsym(module, "Process"));
+  ASSERT_NE(getTable, nullptr);
+  ASSERT_NE(process, nullptr);
+
+  const char* expected[] = {"list", "create", "get", "get_filter", "set_setting",
+                            "set_trigger_time", "set_filter", "delete", "run", "cancel",
+                            "enable", "disable", "get_global_setting", "set_global_setting",
+                            "get_log_list"};
+  const VELT::APIDesc* row = getTable();
+  EXPECT_EQ(row, getTable());
+  for (const char* method : expected) {
+    ASSERT_NE(row->api, nullptr) << "table ends before " << method;
+    EXPECT_STREQ(row->api, "VELT.Plovo");
+    EXPECT_EQ(row->version, 1);
+    EXPECT_STREQ(row->method, method);
+    EXPECT_EQ(row->handler, process);
+    ++row;
+  }
+  EXPECT_EQ(row->api, nullptr);
+
+  // Every row of the table has an action behind it: none is unknown.
+  WriteStatus(4, "");
+  for (row = getTable(); row->api != nullptr; ++row) {
+    VELT::APIRequest request(row->api, row->version, row->method, Json::Value(Json::objectValue));
+    VELT::APIResponse response;
+    row->handler(&request, &response);
+    EXPECT_EQ(response.AnswerCount(), 1) << row->method;
+    EXPECT_NE(response.GetData(), Json::Value("Unknown request")) << row->method;
+  }
+  dlclose(module);
+}
+
+TEST(ModuleExportsTest, OnlyTheEntryPointsAreExported) {
+  CommandResult nm = RunCommand(std::string("nm -D --defined-only ") + PLOVO_MODULE_PATH);
+  ASSERT_EQ(nm.status, 0) << nm.out;
+  std::set<std::string> names;
+  char type;
+  char name[512];
+  for (const char* line = nm.out.c_str(); *line; line = std::strchr(line, '\n') + 1) {
+    if (std::sscanf(line, "%*s %c %511s", &type, name) == 2) names.insert(name);
+    if (std::strchr(line, '\n') == nullptr) break;
+  }
+  std::set<std::string> expected = {"GetAPITable", "Process", "GetServiceStatus",
+                                    "SetServiceStatus"};
+  // Sanitizer builds add their runtime's hooks; only the project's names count.
+  std::set<std::string> ours;
+  for (const std::string& n : names) {
+    if (n.rfind("__", 0) != 0 && n.rfind("_fini", 0) != 0 && n.rfind("_init", 0) != 0) {
+      ours.insert(n);
+    }
+  }
+  EXPECT_EQ(ours, expected) << nm.out;
+}
+
+class PlovoApiTest : public plovo_test::SandboxTest {
+ protected:
+  CommandResult Api(const std::string& args) {
+    return RunCommand("PLOVO_ROOT=" + Root() + " " + PLOVO_API_PATH + " " + args + " 2>&1");
+  }
+};
+
+TEST_F(PlovoApiTest, PrintsOneLineAndExitsByOutcome) {
+  WriteStatus(2, "");
+  CommandResult r = Api("list");
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.out, "{\"success\":false,\"error\":{\"code\":405,\"data\":null}}\n");
+
+  WriteStatus(4, "");
+  r = Api("List '{\"id\": 3}'");
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.out, "{\"success\":false,\"error\":{\"code\":401,\"data\":\"Unknown request\"}}\n");
+}
+
+TEST_F(PlovoApiTest, SuccessAndUnansweredRequestsAsTheModuleLeavesThem) {
+  const std::string echo = std::string("--module ") + ECHO_MODULE_PATH + " ";
+  CommandResult r = Api(echo + "echo '{\"task\": {\"id\": 7, \"name\": \"a b\"}}'");
+  EXPECT_EQ(r.status, 0);
+  EXPECT_EQ(r.out, "{\"success\":true,\"data\":{\"task\":{\"id\":7,\"name\":\"a b\"}}}\n");
+
+  r = Api(echo + "echo");
+  EXPECT_EQ(r.out, "{\"success\":true,\"data\":{}}\n");
+
+  r = Api(echo + "fail");
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.out, "{\"success\":false,\"error\":{\"code\":499,\"data\":\"no\"}}\n");
+
+  // Not in the table, still handed to the module's Process, which stays silent.
+  r = Api(echo + "silent");
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.out, "{\"success\":false,\"error\":{\"code\":100,\"data\":null}}\n");
+}
+
+TEST_F(PlovoApiTest, UsageAndLoadingErrorsExitWithTwo) {
+  EXPECT_EQ(Api("").status, 2);
+  EXPECT_EQ(Api("list '[1, 2]'").status, 2);
+  EXPECT_EQ(Api("list '{broken'").status, 2);
+  EXPECT_EQ(Api("list '{}' extra").status, 2);
+  EXPECT_EQ(Api("--module").status, 2);
+  CommandResult r = Api("--module " + Root() + "/missing.so list");
+  EXPECT_EQ(r.status, 2);
+  EXPECT_NE(r.out.find("cannot load module"), std::string::npos) << r.out;
+}
+
+}  // namespace

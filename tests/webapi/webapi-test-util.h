@@ -1,0 +1,28 @@
+// Calls the module's Process the way the web server does, in a sandbox.
+#ifndef PLOVO_TESTS_WEBAPI_TEST_UTIL_H
+#define PLOVO_TESTS_WEBAPI_TEST_UTIL_H
+
+#include <velt/webapi.h>
+
+#include <string>
+
+#include "sandbox.h"
+#include "webapi/plovo.h"
+
+namespace plovo_test {
+
+class WebApiTest : public SandboxTest {
+ protected:
+  // Sends one request of "VELT.Plovo" version 1 and returns the response.
+  static VELT::APIResponse Call(const std::string& method,
+                                const Json::Value& params = Json::Value(Json::objectValue)) {
+    VELT::APIRequest request("VELT.Plovo", 1, method, params);
+    VELT::APIResponse response;
+    ::Process(&request, &response);
+    return response;
+  }
+};
+
+}  // namespace plovo_test
+
+#endif

@@ -1,0 +1,112 @@
+// plovo-api: the command-line host of the web-API module.
+//
+//   plovo-api [--module PATH] METHOD [PARAMS_JSON]
+//
+// Loads the module the way the web server does (dlopen, GetAPITable, then
+// Process for one request) and prints the answer as one line of JSON:
+//   {"success":true,"data":...}
+//   {"success":false,"error":{"code":N,"data":...}}
+// A request the module leaves unanswered prints error code 100. Exit status:
+// 0 success, 1 an error answer, 2 a usage or loading error.
+#include <dlfcn.h>
+#include <json/json.h>
+#include <unistd.h>
+#include <velt/webapi.h>
+
+#include <cstring>
+#include <iostream>
+#include <memory>
+#include <sstream>
+#include <string>
+
+namespace {
+
+constexpr const char* kApiName = "VELT.Plovo";
+constexpr int kUnanswered = 100;
+
+int Usage(const std::string& why) {
+  std::cerr << "plovo-api: " << why << "\n"
+            << "usage: plovo-api [--module PATH] METHOD [PARAMS_JSON]\n";
+  return 2;
+}
+
+// The module installed beside this program: <bin>/../lib/libplovo-webapi.so.
+std::string DefaultModulePath() {
+  char self[4096];
+  ssize_t n = readlink("/proc/self/exe", self, sizeof(self) - 1);
+  if (n <= 0) return "libplovo-webapi.so";
+  std::string dir(self, static_cast<size_t>(n));
+  dir.erase(dir.rfind('/'));
+  return dir + "/../lib/libplovo-webapi.so";
+}
+
+std::string Compact(const Json::Value& value) {
+  Json::StreamWriterBuilder builder;
+  builder["indentation"] = "";
+  return Json::writeString(builder, value);
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  std::string modulePath = DefaultModulePath();
+  int arg = 1;
+  if (arg < argc && std::strcmp(argv[arg], "--module") == 0) {
+    if (arg + 1 >= argc) return Usage("--module needs a path");
+    modulePath = argv[arg + 1];
+    arg += 2;
+  }
+  if (arg >= argc) return Usage("no method given");
+  const std::string method = argv[arg++];
+  Json::Value params(Json::objectValue);
+  if (arg < argc) {
+    Json::CharReaderBuilder reader;
+    std::string errors;
+    std::istringstream text(argv[arg++]);
+    if (!Json::parseFromStream(reader, text, &params, &errors) || !params.isObject()) {
+      return Usage("PARAMS_JSON must be a JSON object");
+    }
+  }
+  if (arg < argc) return Usage("too many arguments");
+
+  void* module = dlopen(modulePath.c_str(), RTLD_NOW | RTLD_LOCAL);
+  if (module == nullptr) {
+    std::cerr << "plovo-api: cannot load module: " << dlerror() << "\n";
+    return 2;
+  }
+  using GetTableFn = const VELT::APIDesc* (*)();
+  auto getTable = reinterpret_cast<GetTableFn>(dlsym(module, "GetAPITable"));
+  auto process = reinterpret_cast<VELT::APIHandler>(dlsym(module, "Process"));
+  if (getTable == nullptr || process == nullptr) {
+    std::cerr << "plovo-api: " << modulePath << " lacks GetAPITable or Process\n";
+    return 2;
+  }
+
+  // A listed method goes to its row's handler; any other name still goes to
+  // the module's Process so that its own answer to an unknown method shows.
+  VELT::APIHandler handler = process;
+  int version = 1;
+  for (const VELT::APIDesc* row = getTable(); row != nullptr && row->api != nullptr; ++row) {
+    if (std::strcmp(row->api, kApiName) == 0 && method == row->method) {
+      handler = row->handler;
+      version = row->version;
+      break;
+    }
+  }
+
+  VELT::APIRequest request(kApiName, version, method, params);
+  VELT::APIResponse response;
+  handler(&request, &response);
+
+  // Written by hand: the JSON library would sort "data" before "success".
+  if (response.AnswerCount() > 0 && response.IsSuccess()) {
+    std::cout << "{\"success\":true,\"data\":" << Compact(response.GetData()) << "}" << std::endl;
+    return 0;
+  }
+  const bool answered = response.AnswerCount() > 0;
+  std::cout << "{\"success\":false,\"error\":{\"code\":"
+            << (answered ? response.GetErrorCode() : kUnanswered)
+            << ",\"data\":" << Compact(answered ? response.GetData() : Json::Value()) << "}}"
+            << std::endl;
+  return 1;
+}

@@ -1,0 +1,165 @@
+#include "webapi/plovo.h"
+
+#include <exception>
+
+#include "common/log.h"
+#include "common/run-as.h"
+#include "ipc/pobject.h"
+#include "service/service-ctrl.h"
+
+void Process(VELT::APIRequest* request, VELT::APIResponse* response) {
+  // Nothing may be thrown into the web server.
+  try {
+    PlovoHandle handle(request, response);
+    handle.Process();
+  } catch (const std::exception& e) {
+    PLOVO_LOG(LOG_ERR, "Unexpected failure: %s", e.what());
+    response->SetError(401);
+  } catch (...) {
+    PLOVO_LOG(LOG_ERR, "Unexpected failure");
+    response->SetError(401);
+  }
+}
+
+PlovoHandle::PlovoHandle(VELT::APIRequest* request, VELT::APIResponse* response)
+    : request(request), response(response) {}
+
+PlovoHandle::~PlovoHandle() = default;
+
+void PlovoHandle::Process() {
+  if (!IsPlovoReady()) return;
+  if (!IsPermissionAllow()) return;
+  HandleAction();
+}
+
+bool PlovoHandle::IsPermissionAllow() { return true; }
+
+bool PlovoHandle::IsPlovoReady() {
+  ServiceStatus status;
+  {
+    PLOVO_RUN_AS_ROOT(runAs);
+    if (!runAs.ok()) {
+      PLOVO_LOG(LOG_ERR, "Failed to run as root");
+      response->SetError(401);
+      return false;
+    }
+    if (GetServiceStatus(status) != 0) {
+      PLOVO_LOG(LOG_ERR, "Failed to get service status");
+      response->SetError(401);
+      return false;
+    }
+  }
+
+  switch (status.state) {
+    case PLOVO_SERVICE_STATUS_RUNNING:
+      return true;
+    case PLOVO_SERVICE_STATUS_NO_REPO: {
+      // Without a repository the user can still choose its volume.
+      const std::string method = request->GetAPIMethod();
+      if (method == "get_global_setting" || method == "set_global_setting") return true;
+      response->SetError(404);
+      return false;
+    }
+    case PLOVO_SERVICE_STATUS_INIT:
+      response->SetError(405);
+      return false;
+    case PLOVO_SERVICE_STATUS_UPGRADING:
+      response->SetError(406);
+      return false;
+    case PLOVO_SERVICE_STATUS_MOVING_REPO:
+      response->SetError(407);
+      return false;
+    default:
+      if (!status.error.empty()) {
+        PLOVO_LOG(LOG_ERR, "Plovo service errors '%s'", status.error.c_str());
+      }
+      response->SetError(status.error == "err_upgrade_failed" ? 415 : 401);
+      return false;
+  }
+}
+
+void PlovoHandle::HandleAction() {
+  struct ActionRow {
+    const char* method;
+    void (PlovoHandle::*action)();
+  };
+  // Same names, same order as the exported method table.
+  static const ActionRow kActions[] = {
+      {"list", &PlovoHandle::List},
+      {"create", &PlovoHandle::Create},
+      {"get", &PlovoHandle::Get},
+      {"get_filter", &PlovoHandle::GetFilter},
+      {"set_setting", &PlovoHandle::SetSetting},
+      {"set_trigger_time", &PlovoHandle::SetTriggerTime},
+      {"set_filter", &PlovoHandle::SetFilter},
+      {"delete", &PlovoHandle::Delete},
+      {"run", &PlovoHandle::Run},
+      {"cancel", &PlovoHandle::Cancel},
+      {"enable", &PlovoHandle::Enable},
+      {"disable", &PlovoHandle::Disable},
+      {"get_global_setting", &PlovoHandle::GetGlobalSetting},
+      {"set_global_setting", &PlovoHandle::SetGlobalSetting},
+      {"get_log_list", &PlovoHandle::GetLogList},
+      {nullptr, nullptr},
+  };
+
+  const std::string method = request->GetAPIMethod();
+  for (const ActionRow* row = kActions; row->action != nullptr; ++row) {
+    if (method == row->method) {
+      (this->*(row->action))();
+      return;
+    }
+  }
+  PLOVO_LOG(LOG_ERR, "Unknown action '%s'", method.c_str());
+  response->SetError(401, Json::Value("Unknown request"));
+}
+
+int GetErrorCodeFromResponse(const PObject& reply) {
+  if (!reply.hasMember("error_code")) {
+    PLOVO_LOG(LOG_ERR, "no error_code!!!");
+    return 401;
+  }
+  switch (reply["error_code"].asInt32()) {
+    case 3:
+      return 403;
+    case 9:
+      return 410;
+    case 10:
+      return 413;
+    default:
+      return 401;
+  }
+}
+
+namespace {
+
+// Finds the path component that starts at the first character at or after
+// pos that is not '/'. Returns the position just past it (a '/' or the
+// end); the component is empty when only slashes remain.
+size_t NextPathComponent(const std::string& path, size_t pos, std::string& component) {
+  const size_t begin = path.find_first_not_of('/', pos);
+  if (begin == std::string::npos) {
+    component.clear();
+    return path.size();
+  }
+  size_t end = path.find('/', begin);
+  if (end == std::string::npos) end = path.size();
+  component.assign(path, begin, end - begin);
+  return end;
+}
+
+}  // namespace
+
+bool IsSafePath(const std::string& path) {
+  std::string component;
+  size_t pos = 0;
+  while (pos < path.size()) {
+    pos = NextPathComponent(path, pos, component);
+    if (component.empty()) break;
+    if (component == "." || component == ".." ||
+        component.find_first_of(":/") != std::string::npos) {
+      return false;
+    }
+  }
+  return true;
+}
