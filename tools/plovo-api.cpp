@@ -7,9 +7,11 @@
 //   {"success":true,"data":...}
 //   {"success":false,"error":{"code":N,"data":...}}
 // A request the module leaves unanswered prints error code 100. Exit status:
-// 0 success, 1 an error answer, 2 a usage or loading error.
+// 0 success, 1 an error answer, 2 a usage or loading error. The module's
+// log lines go to syslog and, for whoever runs this by hand, to stderr.
 #include <dlfcn.h>
 #include <json/json.h>
+#include <syslog.h>
 #include <unistd.h>
 #include <velt/webapi.h>
 
@@ -69,6 +71,7 @@ int main(int argc, char** argv) {
   }
   if (arg < argc) return Usage("too many arguments");
 
+  openlog("plovo-api", LOG_PERROR, LOG_USER);
   void* module = dlopen(modulePath.c_str(), RTLD_NOW | RTLD_LOCAL);
   if (module == nullptr) {
     std::cerr << "plovo-api: cannot load module: " << dlerror() << "\n";

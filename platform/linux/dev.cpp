@@ -1,0 +1,135 @@
+// Development-platform controls: sandbox root, last error, fault switches.
+#include "velt/dev.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cstdlib>
+#include <map>
+#include <mutex>
+#include <string>
+
+#include "dev-internal.h"
+
+namespace velt_dev {
+namespace {
+
+struct LastError {
+  int code = VLIBC_ERR_NONE;
+  const char* file = "";
+  int line = 0;
+};
+thread_local LastError tLastError;
+
+struct FaultSwitch {
+  int nth;
+  int times;
+  int err;
+  int calls;
+};
+
+struct FaultTable {
+  std::mutex mutex;
+  std::map<std::string, FaultSwitch, std::less<>> switches;
+  // Lets the common case (no switch at all) skip the lock.
+  std::atomic<bool> any{false};
+};
+
+// Never destroyed: platform calls may still run in other threads while the
+// process exits.
+FaultTable& Faults() {
+  static FaultTable* table = new FaultTable;
+  return *table;
+}
+
+}  // namespace
+
+std::string Root() {
+  const char* env = std::getenv("PLOVO_ROOT");
+  std::string root = env ? env : "";
+  while (!root.empty() && root.back() == '/') root.pop_back();
+  return root;
+}
+
+std::string StateDir() { return Root() + "/velt-dev"; }
+
+void SetLastError(int code, const char* file, int line) {
+  tLastError.code = code;
+  tLastError.file = file;
+  tLastError.line = line;
+}
+
+int LastErrorCode() { return tLastError.code; }
+const char* LastErrorFile() { return tLastError.file; }
+int LastErrorLine() { return tLastError.line; }
+
+bool FaultHit(const char* call, const char* file, int line) {
+  FaultTable& table = Faults();
+  if (!table.any.load(std::memory_order_acquire)) return false;
+  int err;
+  {
+    std::lock_guard<std::mutex> lock(table.mutex);
+    auto it = table.switches.find(call);
+    if (it == table.switches.end()) return false;
+    FaultSwitch& sw = it->second;
+    ++sw.calls;
+    if (sw.calls < sw.nth) return false;
+    err = sw.err;
+    if (sw.times >= 1 && sw.calls >= sw.nth + sw.times - 1) {
+      table.switches.erase(it);
+      if (table.switches.empty()) table.any.store(false, std::memory_order_release);
+    }
+  }
+  SetLastError(err, file, line);
+  return true;
+}
+
+int ReadWholeFile(const std::string& path, std::string* out, struct stat* st) {
+  out->clear();
+  int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return errno;
+  int result = 0;
+  if (st && fstat(fd, st) != 0) result = errno;
+  char buf[8192];
+  while (result == 0) {
+    ssize_t n = read(fd, buf, sizeof buf);
+    if (n > 0) {
+      out->append(buf, static_cast<size_t>(n));
+    } else if (n == 0) {
+      break;
+    } else if (errno != EINTR) {
+      result = errno;
+    }
+  }
+  close(fd);
+  return result;
+}
+
+}  // namespace velt_dev
+
+extern "C" {
+
+void VeltDevFailCall(const char* call, int nth, int times, int err) {
+  if (!call) return;
+  velt_dev::FaultTable& table = velt_dev::Faults();
+  std::lock_guard<std::mutex> lock(table.mutex);
+  table.switches[call] = velt_dev::FaultSwitch{nth < 1 ? 1 : nth, times, err, 0};
+  table.any.store(true, std::memory_order_release);
+}
+
+void VeltDevClearFaults(void) {
+  velt_dev::FaultTable& table = velt_dev::Faults();
+  std::lock_guard<std::mutex> lock(table.mutex);
+  table.switches.clear();
+  table.any.store(false, std::memory_order_release);
+}
+
+const char* VeltDevStateDir(void) {
+  thread_local std::string dir;
+  dir = velt_dev::StateDir();
+  return dir.c_str();
+}
+
+}  // extern "C"

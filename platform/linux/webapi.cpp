@@ -1,0 +1,115 @@
+// The web server's request and response objects.
+#include "velt/webapi.h"
+
+#include <limits>
+#include <type_traits>
+#include <utility>
+
+namespace VELT {
+namespace {
+
+// The parameter named key, or null when the request does not carry it.
+const Json::Value* FindParam(const Json::Value& params, const std::string& key) {
+  if (!params.isObject()) return nullptr;
+  return params.find(key.data(), key.data() + key.size());
+}
+
+// The common rules: absent is invalid only when required; present with the
+// wrong type, or refused by the validator, is invalid; an invalid or absent
+// parameter carries the type's default value.
+template <typename T, typename Convert>
+APIParameter<T> Check(const Json::Value& params, const std::string& key, PARAM_NECESSITY necessity,
+                      APIRequest::Validator<T> validator, Convert convert) {
+  const Json::Value* value = FindParam(params, key);
+  if (!value) return APIParameter<T>(necessity == PARAM_REQUIRED, false, T{});
+  T converted{};
+  if (!convert(*value, &converted)) return APIParameter<T>(true, true, T{});
+  if (validator && !validator(converted)) return APIParameter<T>(true, true, T{});
+  return APIParameter<T>(false, true, std::move(converted));
+}
+
+template <typename T>
+bool ToIntegral(const Json::Value& value, T* out) {
+  static_assert(std::is_integral<T>::value && !std::is_same<T, bool>::value, "integral only");
+  // isInt64/isUInt64 accept integers and integral reals that fit, and refuse
+  // strings and booleans.
+  if constexpr (std::is_signed<T>::value) {
+    if (!value.isInt64()) return false;
+    Json::Int64 v = value.asInt64();
+    if (v < static_cast<Json::Int64>(std::numeric_limits<T>::min()) ||
+        v > static_cast<Json::Int64>(std::numeric_limits<T>::max())) {
+      return false;
+    }
+    *out = static_cast<T>(v);
+  } else {
+    if (!value.isUInt64()) return false;
+    Json::UInt64 v = value.asUInt64();
+    if (v > static_cast<Json::UInt64>(std::numeric_limits<T>::max())) return false;
+    *out = static_cast<T>(v);
+  }
+  return true;
+}
+
+}  // namespace
+
+APIRequest::APIRequest(std::string api, int version, std::string method, Json::Value params)
+    : api_(std::move(api)),
+      version_(version),
+      method_(std::move(method)),
+      params_(std::move(params)) {}
+
+template <typename T>
+APIParameter<T> APIRequest::GetAndCheckIntegral(const std::string& key, PARAM_NECESSITY necessity,
+                                                Validator<T> validator) const {
+  return Check<T>(params_, key, necessity, validator, ToIntegral<T>);
+}
+
+template VELT_CXX_API APIParameter<uint64_t> APIRequest::GetAndCheckIntegral<uint64_t>(
+    const std::string&, PARAM_NECESSITY, Validator<uint64_t>) const;
+template VELT_CXX_API APIParameter<uint32_t> APIRequest::GetAndCheckIntegral<uint32_t>(
+    const std::string&, PARAM_NECESSITY, Validator<uint32_t>) const;
+
+APIParameter<std::string> APIRequest::GetAndCheckString(const std::string& key,
+                                                        PARAM_NECESSITY necessity,
+                                                        Validator<std::string> validator) const {
+  return Check<std::string>(params_, key, necessity, validator,
+                            [](const Json::Value& v, std::string* out) {
+                              if (!v.isString()) return false;
+                              *out = v.asString();
+                              return true;
+                            });
+}
+
+APIParameter<bool> APIRequest::GetAndCheckBool(const std::string& key, PARAM_NECESSITY necessity,
+                                               Validator<bool> validator) const {
+  return Check<bool>(params_, key, necessity, validator, [](const Json::Value& v, bool* out) {
+    if (!v.isBool()) return false;
+    *out = v.asBool();
+    return true;
+  });
+}
+
+APIParameter<Json::Value> APIRequest::GetAndCheckObject(const std::string& key,
+                                                        PARAM_NECESSITY necessity,
+                                                        Validator<Json::Value> validator) const {
+  return Check<Json::Value>(params_, key, necessity, validator,
+                            [](const Json::Value& v, Json::Value* out) {
+                              if (!v.isObject()) return false;
+                              *out = v;
+                              return true;
+                            });
+}
+
+void APIResponse::SetSuccess(const Json::Value& data) {
+  ++answers_;
+  error_code_ = 0;
+  data_ = data;
+}
+
+void APIResponse::SetError(int code, const Json::Value& data) {
+  ++answers_;
+  error_code_ = code;
+  data_ = data;
+}
+
+}  // namespace VELT

@@ -93,7 +93,11 @@ TEST(ModuleExportsTest, OnlyTheEntryPointsAreExported) {
 
 class PlovoApiTest : public plovo_test::SandboxTest {
  protected:
+  // The answer line alone; the module's log lines go to stderr.
   CommandResult Api(const std::string& args) {
+    return RunCommand("PLOVO_ROOT=" + Root() + " " + PLOVO_API_PATH + " " + args + " 2>/dev/null");
+  }
+  CommandResult ApiWithStderr(const std::string& args) {
     return RunCommand("PLOVO_ROOT=" + Root() + " " + PLOVO_API_PATH + " " + args + " 2>&1");
   }
 };
@@ -108,6 +112,8 @@ TEST_F(PlovoApiTest, PrintsOneLineAndExitsByOutcome) {
   r = Api("List '{\"id\": 3}'");
   EXPECT_EQ(r.status, 1);
   EXPECT_EQ(r.out, "{\"success\":false,\"error\":{\"code\":401,\"data\":\"Unknown request\"}}\n");
+  r = ApiWithStderr("List");
+  EXPECT_NE(r.out.find("Unknown action 'List'"), std::string::npos) << r.out;
 }
 
 TEST_F(PlovoApiTest, SuccessAndUnansweredRequestsAsTheModuleLeavesThem) {
@@ -135,7 +141,7 @@ TEST_F(PlovoApiTest, UsageAndLoadingErrorsExitWithTwo) {
   EXPECT_EQ(Api("list '{broken'").status, 2);
   EXPECT_EQ(Api("list '{}' extra").status, 2);
   EXPECT_EQ(Api("--module").status, 2);
-  CommandResult r = Api("--module " + Root() + "/missing.so list");
+  CommandResult r = ApiWithStderr("--module " + Root() + "/missing.so list");
   EXPECT_EQ(r.status, 2);
   EXPECT_NE(r.out.find("cannot load module"), std::string::npos) << r.out;
 }
