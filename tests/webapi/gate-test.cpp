@@ -118,22 +118,4 @@ TEST_F(GateTest, ServerThatCannotBecomeRootIsRefused) {
   EXPECT_EQ(WEXITSTATUS(status), 0);
 }
 
-TEST_F(GateTest, IdsAreRestoredAfterTheStateRead) {
-  if (geteuid() != 0) GTEST_SKIP() << "needs root to set up the ids";
-  WriteStatus(4, "");
-  pid_t child = fork();
-  if (child == 0) {
-    if (setresgid(0, 65534, 0) != 0 || setresuid(0, 65534, 0) != 0) _exit(10);
-    LogCapture log;
-    VELT::APIResponse r = Call("list");
-    if (!log.Contains("Method 'list' is not available yet")) _exit(11);
-    if (geteuid() != 65534 || getegid() != 65534) _exit(12);
-    _exit(0);
-  }
-  int status = 0;
-  ASSERT_EQ(waitpid(child, &status, 0), child);
-  ASSERT_TRUE(WIFEXITED(status));
-  EXPECT_EQ(WEXITSTATUS(status), 0);
-}
-
 }  // namespace
