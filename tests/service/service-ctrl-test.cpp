@@ -1,6 +1,5 @@
 #include "service/service-ctrl.h"
 
-#include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <syslog.h>
@@ -42,11 +41,9 @@ TEST_F(ServiceStatusTest, WrittenPairReadsBackAndKeepsOtherLines) {
   ASSERT_EQ(GetServiceStatus(in), 0);
   EXPECT_EQ(in.state, 4);
   EXPECT_EQ(in.error, "");
-}
 
-TEST_F(ServiceStatusTest, OutOfRangeStatesAreTakenAsTheyStand) {
+  // A number outside the enumeration is taken as it stands.
   WriteFile(kStatus, "state=\"-3\"\nerror=\"x\"\n");
-  ServiceStatus in;
   ASSERT_EQ(GetServiceStatus(in), 0);
   EXPECT_EQ(in.state, -3);
 }
