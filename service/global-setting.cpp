@@ -23,7 +23,7 @@ std::string GlobalSetting::GetRepoVolumePath() {
   char value[kRepoPathSize] = {};
   if (VLIBCFileGetKeyValue(Path::SettingFile().c_str(), "repo_vol_path", value, sizeof(value),
                            0) < 0) {
-    LogReadFailure(__FILE_NAME__, __LINE__);
+    LogReadFailure(PLOVO_FILE_NAME, __LINE__);
     return "";
   }
   return value;
@@ -32,7 +32,7 @@ std::string GlobalSetting::GetRepoVolumePath() {
 bool GlobalSetting::GetBeep() {
   char value[kBeepSize] = {};
   if (VLIBCFileGetKeyValue(Path::SettingFile().c_str(), "beep", value, sizeof(value), 0) < 0) {
-    LogReadFailure(__FILE_NAME__, __LINE__);
+    LogReadFailure(PLOVO_FILE_NAME, __LINE__);
     return false;
   }
   return strcasecmp(value, "yes") == 0;
@@ -53,7 +53,7 @@ bool GlobalSetting::InitBeep() {
   const int found =
       VLIBCFileGetKeyValue(Path::SettingFile().c_str(), "beep", value, sizeof(value), 0);
   if (found < 0) {
-    LogReadFailure(__FILE_NAME__, __LINE__);
+    LogReadFailure(PLOVO_FILE_NAME, __LINE__);
     return false;
   }
   return found > 0 || SetBeep(true);

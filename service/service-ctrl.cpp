@@ -7,6 +7,7 @@
 #include <velt/vlibc.h>
 
 #include <cstdlib>
+#include <exception>
 
 #include "common/log.h"
 #include "common/paths.h"
@@ -53,7 +54,9 @@ constexpr size_t kStatusValueSize = 1024;
 ServiceStatus::ServiceStatus() : state(PLOVO_SERVICE_STATUS_UNKNOWN) {}
 ServiceStatus::~ServiceStatus() = default;
 
-int GetServiceStatus(ServiceStatus& status) {
+namespace {
+
+int ReadServiceStatus(ServiceStatus& status) {
   StatusLock lock;
   if (!lock.locked()) return -1;
 
@@ -73,7 +76,7 @@ int GetServiceStatus(ServiceStatus& status) {
   return 0;
 }
 
-int SetServiceStatus(const ServiceStatus& status) {
+int WriteServiceStatus(const ServiceStatus& status) {
   StatusLock lock;
   if (!lock.locked()) return -1;
 
@@ -88,6 +91,27 @@ int SetServiceStatus(const ServiceStatus& status) {
     return -1;
   }
   return 0;
+}
+
+}  // namespace
+
+// Entry points of the module: nothing may be thrown to the caller.
+int GetServiceStatus(ServiceStatus& status) {
+  try {
+    return ReadServiceStatus(status);
+  } catch (const std::exception& e) {
+    PLOVO_LOG(LOG_ERR, "Unexpected failure: %s", e.what());
+    return -1;
+  }
+}
+
+int SetServiceStatus(const ServiceStatus& status) {
+  try {
+    return WriteServiceStatus(status);
+  } catch (const std::exception& e) {
+    PLOVO_LOG(LOG_ERR, "Unexpected failure: %s", e.what());
+    return -1;
+  }
 }
 
 bool IsPkgEnable() { return VLIBCFileExist(Plovo::Path::EnabledFile().c_str()) == 1; }

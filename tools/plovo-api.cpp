@@ -63,6 +63,7 @@ int main(int argc, char** argv) {
   Json::Value params(Json::objectValue);
   if (arg < argc) {
     Json::CharReaderBuilder reader;
+    Json::CharReaderBuilder::strictMode(&reader.settings_);
     std::string errors;
     std::istringstream text(argv[arg++]);
     if (!Json::parseFromStream(reader, text, &params, &errors) || !params.isObject()) {
@@ -101,6 +102,11 @@ int main(int argc, char** argv) {
   VELT::APIResponse response;
   handler(&request, &response);
 
+  // A module answers each request once; say so when it did not.
+  if (response.AnswerCount() > 1) {
+    std::cerr << "plovo-api: the module answered " << response.AnswerCount()
+              << " times; the last answer counts\n";
+  }
   // Written by hand: the JSON library would sort "data" before "success".
   if (response.AnswerCount() > 0 && response.IsSuccess()) {
     std::cout << "{\"success\":true,\"data\":" << Compact(response.GetData()) << "}" << std::endl;

@@ -4,23 +4,23 @@
 #include "common/log.h"
 #include "webapi/plovo.h"
 
-void PlovoHandle::NotAvailableYet() {
-  PLOVO_LOG(LOG_ERR, "Method '%s' is not available yet", request->GetAPIMethod().c_str());
+void PlovoHandle::NotAvailableYet(const char* action) {
+  PLOVO_LOG(LOG_ERR, "Action %s is not available yet", action);
   response->SetError(401);
 }
 
-void PlovoHandle::List() { NotAvailableYet(); }
-void PlovoHandle::Create() { NotAvailableYet(); }
-void PlovoHandle::Get() { NotAvailableYet(); }
-void PlovoHandle::GetFilter() { NotAvailableYet(); }
-void PlovoHandle::SetSetting() { NotAvailableYet(); }
-void PlovoHandle::SetTriggerTime() { NotAvailableYet(); }
-void PlovoHandle::SetFilter() { NotAvailableYet(); }
-void PlovoHandle::Delete() { NotAvailableYet(); }
-void PlovoHandle::Run() { NotAvailableYet(); }
-void PlovoHandle::Cancel() { NotAvailableYet(); }
-void PlovoHandle::Enable() { NotAvailableYet(); }
-void PlovoHandle::Disable() { NotAvailableYet(); }
-void PlovoHandle::GetGlobalSetting() { NotAvailableYet(); }
-void PlovoHandle::SetGlobalSetting() { NotAvailableYet(); }
-void PlovoHandle::GetLogList() { NotAvailableYet(); }
+void PlovoHandle::List() { NotAvailableYet(__func__); }
+void PlovoHandle::Create() { NotAvailableYet(__func__); }
+void PlovoHandle::Get() { NotAvailableYet(__func__); }
+void PlovoHandle::GetFilter() { NotAvailableYet(__func__); }
+void PlovoHandle::SetSetting() { NotAvailableYet(__func__); }
+void PlovoHandle::SetTriggerTime() { NotAvailableYet(__func__); }
+void PlovoHandle::SetFilter() { NotAvailableYet(__func__); }
+void PlovoHandle::Delete() { NotAvailableYet(__func__); }
+void PlovoHandle::Run() { NotAvailableYet(__func__); }
+void PlovoHandle::Cancel() { NotAvailableYet(__func__); }
+void PlovoHandle::Enable() { NotAvailableYet(__func__); }
+void PlovoHandle::Disable() { NotAvailableYet(__func__); }
+void PlovoHandle::GetGlobalSetting() { NotAvailableYet(__func__); }
+void PlovoHandle::SetGlobalSetting() { NotAvailableYet(__func__); }
+void PlovoHandle::GetLogList() { NotAvailableYet(__func__); }

@@ -34,14 +34,29 @@ constexpr int LogStemLength(const char* name) {
   return dot < 0 ? n : dot;
 }
 
+// The file name of a source path, for compilers without __FILE_NAME__.
+constexpr const char* LogBaseName(const char* path) {
+  const char* name = path;
+  for (const char* p = path; *p != '\0'; ++p) {
+    if (*p == '/') name = p + 1;
+  }
+  return name;
+}
+
 }  // namespace Plovo
 
+#ifdef __FILE_NAME__
+#define PLOVO_FILE_NAME __FILE_NAME__
+#else
+#define PLOVO_FILE_NAME ::Plovo::LogBaseName(__FILE__)
+#endif
+
 #define PLOVO_LOG(priority, format, ...) \
-  ::Plovo::LogWrite((priority), "%s:%d " format, __FILE_NAME__, __LINE__, ##__VA_ARGS__)
+  ::Plovo::LogWrite((priority), "%s:%d " format, PLOVO_FILE_NAME, __LINE__, ##__VA_ARGS__)
 
 #define PLOVO_LIB_LOG_(priority, tag, format, ...)                                            \
-  ::Plovo::LogWrite((priority), tag " %.*s(%d): " format, ::Plovo::LogStemLength(__FILE_NAME__), \
-                    __FILE_NAME__, __LINE__, ##__VA_ARGS__)
+  ::Plovo::LogWrite((priority), tag " %.*s(%d): " format, ::Plovo::LogStemLength(PLOVO_FILE_NAME), \
+                    PLOVO_FILE_NAME, __LINE__, ##__VA_ARGS__)
 #define PLOVO_LIB_ERR(format, ...) PLOVO_LIB_LOG_(LOG_ERR, "[ERR]", format, ##__VA_ARGS__)
 #define PLOVO_LIB_WARN(format, ...) PLOVO_LIB_LOG_(LOG_WARNING, "[WARN]", format, ##__VA_ARGS__)
 #define PLOVO_LIB_INFO(format, ...) PLOVO_LIB_LOG_(LOG_INFO, "[INFO]", format, ##__VA_ARGS__)

@@ -1,47 +1,50 @@
-// Raising the effective user and group ids for the length of a scope.
+// Raising the effective user and group ids to root for the length of a
+// scope.
 //
 // The web server runs requests with its own ids; the steps that need root
-// (the status lock, the repository, the databases) raise to root with a
-// RunAs guard and drop back when the guard ends, on every path. Nothing
-// else in the module changes ids. The real and saved ids are never
-// touched, so dropping back is always possible.
+// (the status lock, the repository, the databases) raise with a RunAsRoot
+// guard and drop back when the guard ends, on every path. Nothing else in
+// the module changes ids. The real and saved ids are never touched, so
+// dropping back is always possible.
 //
-// Ids are per process: a guard changes them for every thread of the web
-// server until it ends, so keep the scope short.
+// Ids belong to the whole process, and the server runs requests on several
+// threads. The guards therefore share one record: the first guard to start
+// remembers the ids and raises, the last one to end restores them. While any
+// guard lives, every thread of the process runs as root, so keep scopes
+// short.
 #ifndef PLOVO_COMMON_RUN_AS_H
 #define PLOVO_COMMON_RUN_AS_H
 
-#include <sys/types.h>
+#include "common/log.h"
 
 namespace Plovo {
 
-class RunAs {
+class RunAsRoot {
  public:
-  // Sets the effective ids to uid and gid (user, then group, then user
-  // again, each only where it differs). A failure is logged as
-  // "<file>:<line> ERROR: IF_RUN_AS(uid, gid)" at LOG_AUTH | LOG_ERR, with
-  // the file and line of the guard's user; ok() then answers false.
-  RunAs(uid_t uid, gid_t gid, const char* file, int line);
-  // Restores the ids the constructor found: group first, then user. A
+  // Makes the effective user and group root (user first, since only root
+  // may change the group, then the user again), each only where it
+  // differs. A failure is logged as "<file>:<line> ERROR: IF_RUN_AS(0, 0)"
+  // at LOG_AUTH | LOG_ERR with the guard's own file and line; ok() then
+  // answers false.
+  RunAsRoot(const char* file, int line);
+  // The last guard to end restores the remembered ids, group first. A
   // failure is logged at LOG_AUTH | LOG_CRIT as
   // "<file>:<line> ERROR: ~IF_RUN_AS(uid, gid)" with the ids it restores.
-  ~RunAs();
-  RunAs(const RunAs&) = delete;
-  RunAs& operator=(const RunAs&) = delete;
+  ~RunAsRoot();
+  RunAsRoot(const RunAsRoot&) = delete;
+  RunAsRoot& operator=(const RunAsRoot&) = delete;
 
   bool ok() const { return ok_; }
 
  private:
-  uid_t savedUid_;
-  gid_t savedGid_;
   const char* file_;
   int line_;
-  bool ok_ = true;
+  bool ok_ = false;
 };
 
 }  // namespace Plovo
 
 // Declares a guard named `name` that raises to root for the rest of the scope.
-#define PLOVO_RUN_AS_ROOT(name) ::Plovo::RunAs name(0, 0, __FILE_NAME__, __LINE__)
+#define PLOVO_RUN_AS_ROOT(name) ::Plovo::RunAsRoot name(PLOVO_FILE_NAME, __LINE__)
 
 #endif

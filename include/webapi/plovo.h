@@ -65,8 +65,9 @@ class PlovoHandle {
   void SetGlobalSetting();
   void GetLogList();
 
-  // Answer of a method whose action has not been built yet: 401.
-  void NotAvailableYet();
+  // Answer of a method whose action has not been built yet: 401, and a log
+  // line naming the action.
+  void NotAvailableYet(const char* action);
 
   VELT::APIRequest* request;
   VELT::APIResponse* response;

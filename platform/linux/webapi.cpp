@@ -102,12 +102,14 @@ APIParameter<Json::Value> APIRequest::GetAndCheckObject(const std::string& key,
 
 void APIResponse::SetSuccess(const Json::Value& data) {
   ++answers_;
+  success_ = true;
   error_code_ = 0;
   data_ = data;
 }
 
 void APIResponse::SetError(int code, const Json::Value& data) {
   ++answers_;
+  success_ = false;
   error_code_ = code;
   data_ = data;
 }

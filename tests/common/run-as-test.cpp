@@ -4,7 +4,10 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <functional>
+#include <thread>
+#include <vector>
 
 #include "log-capture.h"
 #include "sandbox.h"
@@ -61,6 +64,31 @@ TEST(RunAsTest, FailureToRaiseIsLoggedAndNothingChanges) {
     if (!log.Contains(LOG_AUTH | LOG_ERR, "ERROR: IF_RUN_AS(0, 0)")) return 13;
     if (log.Contains("~IF_RUN_AS")) return 14;  // nothing was changed, nothing to restore
     if (geteuid() != kNobody || getegid() != kNogroup) return 15;
+    return 0;
+  });
+  EXPECT_EQ(result, 0);
+}
+
+TEST(RunAsTest, GuardsOnSeveralThreadsRestoreOnlyAtTheLast) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to set up the ids";
+  int result = InChild([] {
+    if (setresgid(0, kNogroup, 0) != 0 || setresuid(0, kNobody, 0) != 0) return 10;
+    // Each guard must see root for its whole scope, though other threads'
+    // guards start and end meanwhile; a guard that restored what another
+    // raised would leave the process as root, or drop it mid-scope.
+    std::atomic<int> notRoot{0};
+    std::vector<std::thread> threads;
+    for (int t = 0; t < 8; ++t) {
+      threads.emplace_back([&notRoot] {
+        for (int i = 0; i < 300; ++i) {
+          PLOVO_RUN_AS_ROOT(guard);
+          if (!guard.ok() || geteuid() != 0 || getegid() != 0) ++notRoot;
+        }
+      });
+    }
+    for (std::thread& t : threads) t.join();
+    if (notRoot != 0) return 11;
+    if (geteuid() != kNobody || getegid() != kNogroup) return 12;
     return 0;
   });
   EXPECT_EQ(result, 0);

@@ -55,7 +55,7 @@ TEST_F(GateTest, WithoutRepositoryOnlyGlobalSettingsPass) {
     VELT::APIResponse r = Call(method);
     const std::string m = method;
     if (m == "get_global_setting" || m == "set_global_setting") {
-      EXPECT_TRUE(log.Contains("Method '" + m + "' is not available yet")) << log.Dump();
+      EXPECT_TRUE(log.Contains("is not available yet")) << m << "\n" << log.Dump();
     } else {
       EXPECT_EQ(r.GetErrorCode(), 404) << method;
     }
@@ -77,24 +77,25 @@ TEST_F(GateTest, ErrorStateIsLoggedByName) {
 }
 
 TEST_F(GateTest, UnreadableStateStopsEveryRequest) {
-  LogCapture log;
-  // No status file at all.
-  EXPECT_EQ(Call("get_global_setting").GetErrorCode(), 401);
-  EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to get service status")) << log.Dump();
-
-  // A status file without "error".
-  WriteFile("/var/packages/Plovo/etc/status", "state=\"4\"\n");
-  EXPECT_EQ(Call("list").GetErrorCode(), 401);
-
+  {
+    LogCapture log;
+    // No status file at all.
+    EXPECT_EQ(Call("get_global_setting").GetErrorCode(), 401);
+    EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to get service status")) << log.Dump();
+    // A status file without "error".
+    WriteFile("/var/packages/Plovo/etc/status", "state=\"4\"\n");
+    EXPECT_EQ(Call("list").GetErrorCode(), 401);
+    EXPECT_FALSE(log.Contains("is not available yet"));
+  }
   // A lock file that cannot be created (the earlier requests made a real
   // one; a folder takes its place).
   WriteStatus(4, "");
   ASSERT_EQ(std::remove(Path("/var/packages/Plovo/etc/status.lock").c_str()), 0);
   MakeDir("/var/packages/Plovo/etc/status.lock");
-  LogCapture lockLog;
+  LogCapture log;
   EXPECT_EQ(Call("list").GetErrorCode(), 401);
-  EXPECT_TRUE(lockLog.Contains("Failed to open plovo status lock file.")) << lockLog.Dump();
-  EXPECT_FALSE(lockLog.Contains("is not available yet"));
+  EXPECT_TRUE(log.Contains("Failed to open plovo status lock file.")) << log.Dump();
+  EXPECT_FALSE(log.Contains("is not available yet"));
 }
 
 TEST_F(GateTest, ServerThatCannotBecomeRootIsRefused) {

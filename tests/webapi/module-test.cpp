@@ -66,6 +66,25 @@ TEST_F(ModuleTest, TableListsFifteenMethodsServedByProcess) {
   dlclose(module);
 }
 
+TEST_F(ModuleTest, TableKeepsItsOwnProcessBesideAnotherModule) {
+  // A library loaded earlier with global symbols also defines Process; the
+  // module's table and gate must still reach the module's own code.
+  void* other = dlopen(ECHO_MODULE_PATH, RTLD_NOW | RTLD_GLOBAL);
+  ASSERT_NE(other, nullptr) << dlerror();
+  void* module = dlopen(PLOVO_MODULE_PATH, RTLD_NOW | RTLD_LOCAL);
+  ASSERT_NE(module, nullptr) << dlerror();
+  auto getTable = reinterpret_cast<const VELT::APIDesc* (*)()>(dlsym(module, "GetAPITable"));
+  ASSERT_NE(getTable, nullptr);
+  WriteStatus(2, "");
+  VELT::APIRequest request("VELT.Plovo", 1, "list", Json::Value(Json::objectValue));
+  VELT::APIResponse response;
+  getTable()[0].handler(&request, &response);
+  EXPECT_EQ(response.AnswerCount(), 1);
+  EXPECT_EQ(response.GetErrorCode(), 405);
+  dlclose(module);
+  dlclose(other);
+}
+
 TEST(ModuleExportsTest, OnlyTheEntryPointsAreExported) {
   CommandResult nm = RunCommand(std::string("nm -D --defined-only -j ") + PLOVO_MODULE_PATH);
   ASSERT_EQ(nm.status, 0) << nm.out;
@@ -120,6 +139,7 @@ TEST_F(PlovoApiTest, UsageAndLoadingErrorsExitWithTwo) {
   EXPECT_EQ(Api("").status, 2);
   EXPECT_EQ(Api("list '[1, 2]'").status, 2);
   EXPECT_EQ(Api("list '{broken'").status, 2);
+  EXPECT_EQ(Api("list '{\"a\": 1} trailing'").status, 2);
   EXPECT_EQ(Api("list '{}' extra").status, 2);
   EXPECT_EQ(Api("--module").status, 2);
   CommandResult r = ApiWithStderr("--module " + Root() + "/missing.so list");

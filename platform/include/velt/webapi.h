@@ -110,12 +110,14 @@ class VELT_CXX_API APIResponse {
   void SetError(int code, const Json::Value& data = Json::Value());
 
   int AnswerCount() const { return answers_; }
-  bool IsSuccess() const { return answers_ > 0 && error_code_ == 0; }
+  /* True when the last answer was SetSuccess. */
+  bool IsSuccess() const { return success_; }
   int GetErrorCode() const { return error_code_; }
   const Json::Value& GetData() const { return data_; }
 
  private:
   int answers_ = 0;
+  bool success_ = false;
   int error_code_ = 0;
   Json::Value data_;
 };
