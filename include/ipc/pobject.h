@@ -199,29 +199,16 @@ class PObject {
   void* data_;
 };
 
-template <>
-struct PObject::type_trait<PObject::array_type> {
-  static constexpr uint32_t value = 1;
+// The tags are the wire format's; they must never change.
+template <uint32_t Tag>
+struct PObjectTypeTag {
+  static constexpr uint32_t value = Tag;
 };
-template <>
-struct PObject::type_trait<PObject::map_type> {
-  static constexpr uint32_t value = 2;
-};
-template <>
-struct PObject::type_trait<uint64_t> {
-  static constexpr uint32_t value = 3;
-};
-template <>
-struct PObject::type_trait<std::string> {
-  static constexpr uint32_t value = 4;
-};
-template <>
-struct PObject::type_trait<PObject::binary_type> {
-  static constexpr uint32_t value = 5;
-};
-template <>
-struct PObject::type_trait<PObject::buffer_type> {
-  static constexpr uint32_t value = 6;
-};
+template <> struct PObject::type_trait<PObject::array_type> : PObjectTypeTag<1> {};
+template <> struct PObject::type_trait<PObject::map_type> : PObjectTypeTag<2> {};
+template <> struct PObject::type_trait<uint64_t> : PObjectTypeTag<3> {};
+template <> struct PObject::type_trait<std::string> : PObjectTypeTag<4> {};
+template <> struct PObject::type_trait<PObject::binary_type> : PObjectTypeTag<5> {};
+template <> struct PObject::type_trait<PObject::buffer_type> : PObjectTypeTag<6> {};
 
 #endif
