@@ -13,6 +13,14 @@ if(PLOVO_SANITIZE)
   add_link_options(${_plovo_san})
 endif()
 
+# Coverage instrumentation for libFuzzer in every library the targets link.
+if(PLOVO_FUZZ)
+  if(NOT CMAKE_CXX_COMPILER_ID STREQUAL "Clang")
+    message(FATAL_ERROR "PLOVO_FUZZ needs clang (CXX=clang++)")
+  endif()
+  add_compile_options(-fsanitize=fuzzer-no-link)
+endif()
+
 # plovo_library(NAME SOURCES... [LIBS ...]): one static subsystem library,
 # position independent so that the module can link it.
 function(plovo_library name)

@@ -25,6 +25,12 @@ void LogWrite(int priority, const char* format, ...) __attribute__((format(print
 using LogSink = std::function<void(int priority, const std::string& line)>;
 void SetLogSink(LogSink sink);
 
+// Whether a line at priority would be written anywhere: always with a sink
+// installed, otherwise when the process's syslog mask (setlogmask) admits
+// it. Code that traces every value of a message asks once per message, so
+// that a server which masks out debug lines pays nothing for them.
+bool LogWillWrite(int priority);
+
 // Length of a file name without its extension, for "[ERR] %s(%d): ".
 constexpr int LogStemLength(const char* name) {
   int dot = -1, n = 0;

@@ -1,0 +1,76 @@
+// Feeds arbitrary bytes to the message receiver through a real socket pair.
+// Any input must give 0 or a negative code: never a crash, a hang, a leak or
+// memory out of proportion to the input.
+#include <dirent.h>
+#include <stdlib.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cstdint>
+#include <string>
+
+#include "common/log.h"
+#include "ipc/channel.h"
+#include "ipc/pobject.h"
+#include "ipc/stream.h"
+
+namespace {
+
+// Received files (binaries without a destination) land here and are
+// removed after every input.
+const std::string& ScratchDir() {
+  static const std::string dir = [] {
+    char templ[] = "/tmp/plovo-fuzz-XXXXXX";
+    const char* made = mkdtemp(templ);
+    if (made == nullptr) abort();
+    return std::string(made);
+  }();
+  return dir;
+}
+
+void EmptyScratchDir() {
+  DIR* dir = opendir(ScratchDir().c_str());
+  if (dir == nullptr) return;
+  while (dirent* entry = readdir(dir)) {
+    std::string name = entry->d_name;
+    if (name != "." && name != "..") unlink((ScratchDir() + "/" + name).c_str());
+  }
+  closedir(dir);
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerInitialize(int*, char***) {
+  // A sink makes the receiver format its debug trace too, without syslog.
+  Plovo::SetLogSink([](int, const std::string&) {});
+  return 0;
+}
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  int fds[2];
+  if (socketpair(AF_UNIX, SOCK_STREAM, 0, fds) != 0) abort();
+  int buffer = 1 << 20;  // the whole input fits, so one thread can write it all first
+  setsockopt(fds[1], SOL_SOCKET, SO_SNDBUF, &buffer, sizeof(buffer));
+  setsockopt(fds[0], SOL_SOCKET, SO_RCVBUF, &buffer, sizeof(buffer));
+  size_t written = 0;
+  while (written < size) {
+    ssize_t n = send(fds[1], data + written, size - written, MSG_DONTWAIT | MSG_NOSIGNAL);
+    if (n <= 0) break;  // what does not fit is simply not part of this input
+    written += static_cast<size_t>(n);
+  }
+  close(fds[1]);
+
+  int result;
+  {
+    Channel channel(81920);
+    if (channel.Open(fds[0], true) != 0) abort();
+    channel.SetTimeout(1);
+    PStream stream;
+    stream.SetDefaultRecvLocation(ScratchDir());
+    PObject value;
+    result = stream.Recv(channel, value);
+  }
+  EmptyScratchDir();
+  if (result > 0) abort();
+  return 0;
+}

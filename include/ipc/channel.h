@@ -1,0 +1,162 @@
+// Channel: a buffered, time-limited byte channel over one stream socket (a
+// Unix domain socket, an IPv4 TCP socket, or an adopted descriptor),
+// optionally switched to TLS. PStream reads and writes messages through it;
+// IPCSender and IPCListener own and open it.
+//
+// Writes collect in a write buffer and leave on FlushWrite (or when the
+// buffer must make room); reads pull whole buffer-loads into a read ring.
+// Every wait on the socket is a select() with a short interval (1 second),
+// repeated until the overall time limit (60 seconds, 0 = none) passes
+// without progress or until the caller's cancel flag is raised. The socket
+// is read or written at once when it is ready; select() is used only when
+// it is not.
+//
+// Results are the shared codes of ipc/error-code.h: 0 success, -1 cancel
+// flag raised, -2 I/O error (peer closed, closed channel), -3 system error,
+// -4 invalid argument, -5 time limit, -6 TLS peer not verified. Every
+// failure is logged at warning level.
+//
+// Ownership: the channel owns its descriptor (or TLS session and context)
+// and its two buffers; Close() and the destructor release the handle.
+// Threading: one thread at a time uses a channel. The cancel flag is the one
+// cross-thread input: another thread may set the pointed-to int to stop a
+// blocked read or flush within one interval.
+#ifndef PLOVO_IPC_CHANNEL_H
+#define PLOVO_IPC_CHANNEL_H
+
+#include <openssl/ssl.h>
+#include <sys/time.h>
+
+#include <string>
+
+class Channel {
+ public:
+  // Allocates both buffers of capacity bytes; capacity is also the largest
+  // block one Write accepts. The channel starts closed, in plain mode.
+  explicit Channel(unsigned long capacity);
+  virtual ~Channel();
+  Channel(const Channel&) = delete;
+  Channel& operator=(const Channel&) = delete;
+
+  // Connects a Unix domain stream socket to path. -3 when no socket can be
+  // made or set non-blocking, -2 when the connect fails. Does not refuse an
+  // already open channel.
+  virtual int Open(const char* path);
+  // Adopts an open descriptor. With setOptions: 1-second linger and
+  // non-blocking mode (-3 on failure). -4 for fd -1 or when the channel is
+  // already open (the old descriptor is kept).
+  virtual int Open(int fd, bool setOptions);
+  // Connects to a dotted IPv4 address with the channel's waits. A null ip or
+  // a negative port returns 0 without opening anything.
+  virtual int Open(const char* ip, int port);
+  // Flushes what is buffered, drops both buffers, releases the handle and
+  // returns to plain mode. Returns 0.
+  virtual int Close();
+  // The overall time limit in seconds; 0 waits without limit.
+  virtual void SetTimeout(unsigned int seconds);
+  // Installs the caller-owned cancel flag (null: none).
+  virtual void SetFlag(int* flag);
+  // Runs the TLS handshake on the open descriptor, as the server or the
+  // client end, and switches the channel to TLS. 0 when already converted.
+  virtual int ConvertToSSLChannel(bool server);
+
+  // Integers travel most significant byte first.
+  virtual int ReadByte(unsigned char* value);
+  virtual int ReadInt16(unsigned short* value);
+  virtual int ReadInt32(unsigned int* value);
+  virtual int ReadInt64(unsigned long* value);
+  virtual int WriteByte(unsigned char value);
+  virtual int WriteInt16(unsigned short value);
+  virtual int WriteInt32(unsigned int value);
+  virtual int WriteInt64(unsigned long value);
+
+  // Reads exactly n bytes. On failure got holds the bytes delivered so far.
+  virtual int Read(char* buf, unsigned long n);
+  virtual int Read(char* buf, unsigned long n, unsigned long& got);
+  // Buffers n bytes (n <= capacity, else -4 and nothing buffered), flushing
+  // first only as much as needed to make room.
+  virtual int Write(const char* data, unsigned long n);
+  virtual void ClearRead();
+  virtual void ClearWrite();
+  // Sends buffered bytes until at least atLeast of them left (0: all).
+  virtual int FlushWrite(unsigned long atLeast);
+  // The peer's dotted IPv4 address and port; ip empty and port 0 when
+  // unknown. Returns 0 (also on a closed channel) or -3.
+  virtual int GetPeerInfo(std::string& ip, int& port) const;
+  virtual bool IsClosed() const;
+
+  // TLS settings. The paths are shared by all channels.
+  void SetAllowUntrust(bool allow) { m_allow_untrust = allow; }
+  bool IsAllowingUntrust() const { return m_allow_untrust; }
+  static void SetCERTPath(const std::string& path) { m_cert_path = path; }
+  static void SetPriKeyPath(const std::string& path) { m_key_path = path; }
+  static void SetVerifyCAPath(const std::string& path) { m_ca_path = path; }
+
+  static std::string m_cert_path;  // server certificate, PEM
+  static std::string m_key_path;   // server private key, PEM
+  static std::string m_ca_path;    // CA file a client verifies the server with
+
+ protected:
+  // Fills the read buffer with at least want bytes.
+  virtual int ReadMore(unsigned long want);
+  // Byte order reversal at each width.
+  virtual unsigned long Convert(unsigned long value);
+  virtual unsigned int Convert(unsigned int value);
+  virtual unsigned short Convert(unsigned short value);
+  // An IPv4 stream socket, or -1.
+  virtual int CreateSock();
+  virtual int SetLinger(int fd, int seconds);
+  virtual int SetNonBlock(int fd);
+  // Non-blocking connect with the channel's waits; every unanswered
+  // interval counts 3 towards the time limit.
+  virtual int ConnectWithTimeout(int fd, const char* ip, int port);
+  // Mode 1 selects the plain operations, any other mode the TLS ones.
+  virtual void SwitchChannelOp(int mode);
+
+ private:
+  // The five operations of a mode.
+  struct Ops {
+    long (*read)(Channel& ch, char* buf, unsigned long n);
+    long (*write)(Channel& ch, const char* buf, unsigned long n);
+    int (*fd)(const Channel& ch);
+    void (*destroy)(Channel& ch);
+    bool (*closed)(const Channel& ch);
+  };
+  static const Ops kPlainOps;
+  static const Ops kTlsOps;
+
+  static long PlainRead(Channel& ch, char* buf, unsigned long n);
+  static long PlainWrite(Channel& ch, const char* buf, unsigned long n);
+  static int PlainFd(const Channel& ch);
+  static void PlainDestroy(Channel& ch);
+  static bool PlainClosed(const Channel& ch);
+  static long TlsRead(Channel& ch, char* buf, unsigned long n);
+  static long TlsWrite(Channel& ch, const char* buf, unsigned long n);
+  static int TlsFd(const Channel& ch);
+  static void TlsDestroy(Channel& ch);
+  static bool TlsClosed(const Channel& ch);
+
+  int InitSSL(SSL** ssl, SSL_CTX** ctx, bool server);
+  int SSLHandshake(SSL* ssl, timeval interval, unsigned int limit);
+  static void DeinitSSL(SSL** ssl, SSL_CTX** ctx, bool quiet);
+  static void log_ssl();
+  // The flag is written by another thread, hence the atomic read.
+  bool Cancelled() const { return m_flag != nullptr && __atomic_load_n(m_flag, __ATOMIC_RELAXED) != 0; }
+
+  void* m_handle = nullptr;  // plain: int* holding the descriptor; TLS: SSL*
+  const Ops* m_ops = &kPlainOps;
+  char* m_wbuf = nullptr;
+  unsigned long m_whead = 0;
+  unsigned long m_wsize = 0;
+  char* m_rbuf = nullptr;
+  unsigned long m_rhead = 0;
+  unsigned long m_rsize = 0;
+  unsigned long m_capacity;
+  timeval m_interval{1, 0};
+  unsigned int m_timeout = 60;
+  int* m_flag = nullptr;
+  bool m_ssl = false;
+  bool m_allow_untrust = true;
+};
+
+#endif

@@ -1,0 +1,40 @@
+#include "ipc/daemon-ipc.h"
+
+#include "common/log.h"
+#include "common/paths.h"
+#include "ipc/simple-ipc.h"
+
+DaemonIPC::DaemonIPC() : m_socket_path(Plovo::Path::DaemonSocket()) {}
+
+int DaemonIPC::SendCommand(const PObject& request, PObject& response) {
+  const bool trace = Plovo::LogWillWrite(LOG_DEBUG);
+  IPCSender sender;
+  if (sender.connect(m_socket_path) != 0) {
+    PLOVO_LIB_ERR("Failed to connect at '%s'", m_socket_path.c_str());
+    return -1;
+  }
+  if (sender.send(request) != 0) {
+    PLOVO_LIB_ERR("Failed to send request.");
+    return -1;
+  }
+  if (trace) PLOVO_LIB_DBG("DaemonIPC: send request >>> %s", request.toString().c_str());
+  if (request.hasMember("need_ack") && !request["need_ack"].asBool()) {
+    PLOVO_LIB_DBG("DaemonIPC: no need ack");
+    return 0;
+  }
+  if (sender.recv(response) != 0) {
+    PLOVO_LIB_ERR("Failed to receive response.");
+    return -1;
+  }
+  if (trace) PLOVO_LIB_DBG("DaemonIPC: recv response <<< %s", response.toString().c_str());
+  if (response.hasMember("error")) {
+    PLOVO_LIB_ERR("SendCommand error: %s", response["error"].toString().c_str());
+    return -1;
+  }
+  if (response["ack"].asString() == "ok") {
+    PLOVO_LIB_DBG("Recieve ack.");
+    return 0;
+  }
+  PLOVO_LIB_ERR("Can not recieve ack.");
+  return -1;
+}

@@ -1,0 +1,469 @@
+#include "ipc/stream.h"
+
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <memory>
+
+#include "common/log.h"
+#include "common/tmp-name.h"
+#include "ipc/error-code.h"
+
+namespace {
+
+constexpr uint64_t kProgressStep = 104857600;  // 100 MiB between progress lines
+constexpr size_t kMaxIndent = 11;              // levels of debug indentation
+constexpr size_t kMaxString = 65535;           // what a 16-bit length can say
+
+struct FileCloser {
+  void operator()(FILE* f) const {
+    if (f != nullptr) fclose(f);
+  }
+};
+using File = std::unique_ptr<FILE, FileCloser>;
+
+// The receiver's mapping of a failed write to its file.
+int StoreError() { return errno == ENOSPC ? P_ERR_INVALID_ARGUMENT : P_ERR_INTERRUPTED; }
+
+}  // namespace
+
+void PStream::GetVersion(int& major, int& minor, int& patch) {
+  major = 1;
+  minor = 0;
+  patch = 0;
+}
+
+// ---- error stack and progress ------------------------------------------------
+
+void PStream::PushHistory(const std::string& key) {
+  std::lock_guard<std::mutex> lock(m_mutex);
+  m_history.push_back(key);
+}
+
+void PStream::PopHistory() {
+  std::lock_guard<std::mutex> lock(m_mutex);
+  if (!m_history.empty()) m_history.pop_back();
+}
+
+std::string PStream::JoinHistory() const {
+  std::string joined;
+  for (const std::string& key : m_history) {
+    if (!joined.empty()) joined += '.';
+    joined += key;
+  }
+  return joined;
+}
+
+void PStream::GetStatus(std::string& history, uint64_t& done, uint64_t& total) {
+  std::lock_guard<std::mutex> lock(m_mutex);
+  history = JoinHistory();
+  done = m_done;
+  total = m_total;
+}
+
+void PStream::DumpHistory() {
+  std::lock_guard<std::mutex> lock(m_mutex);
+  PLOVO_LIB_ERR("Error stack: %s", JoinHistory().c_str());
+}
+
+std::string PStream::GetHistory() {
+  std::lock_guard<std::mutex> lock(m_mutex);
+  return JoinHistory();
+}
+
+void PStream::ClearHistory() {
+  std::lock_guard<std::mutex> lock(m_mutex);
+  m_history.clear();
+}
+
+// Records the progress of the binary transfer under way for GetStatus.
+void PStream::UpdateStatus(uint64_t done, uint64_t total) {
+  std::lock_guard<std::mutex> lock(m_mutex);
+  m_done = done;
+  m_total = total;
+}
+
+int PStream::Skip(Channel&, uint8_t) { return P_ERR_TIMEOUT; }
+
+std::string PStream::Indent() const { return std::string(2 * std::min<uint64_t>(m_depth, kMaxIndent), ' '); }
+
+// ---- sending -----------------------------------------------------------------
+
+int PStream::Send(Channel& ch, const PObject& value) {
+  m_trace = Plovo::LogWillWrite(LOG_DEBUG);
+  int ret = SendObject(ch, value);
+  if (ret == 0) {
+    int flushed = ch.FlushWrite(0);
+    if (flushed != 0) {
+      PLOVO_LIB_ERR("Channel: %d", flushed);
+      ret = P_ERR_IO;
+    }
+  } else {
+    DumpHistory();
+  }
+  ClearHistory();
+  return ret;
+}
+
+int PStream::SendObject(Channel& ch, const PObject& value) {
+  if (value.isNull()) return SendNull(ch);
+  if (value.isInteger()) return Send(ch, value.asUInt64());
+  if (value.isString()) return Send(ch, value.asString());
+  if (value.isMap()) return Send(ch, value.asMap());
+  if (value.isArray()) return Send(ch, value.asArray());
+  if (value.isBinary()) return Send(ch, value.asBinary());
+  PLOVO_LIB_ERR("PStream: type %s has no wire form", value.isBuffer() ? "buffer" : "unknown");
+  return P_ERR_INTERRUPTED;
+}
+
+int PStream::SendNull(Channel& ch) {
+  static const char kNull[2] = {TAG_NULL, 0};
+  return ch.Write(kNull, sizeof(kNull)) == 0 ? 0 : P_ERR_IO;
+}
+
+int PStream::Send(Channel& ch, uint64_t number) {
+  unsigned char bytes[10];
+  unsigned width = number <= 0xFF ? 1 : number <= 0xFFFF ? 2 : number <= 0xFFFFFFFFull ? 4 : 8;
+  bytes[0] = TAG_INTEGER;
+  bytes[1] = static_cast<unsigned char>(width);
+  for (unsigned i = 0; i < width; ++i) bytes[2 + i] = static_cast<unsigned char>(number >> (8 * (width - 1 - i)));
+  if (ch.Write(reinterpret_cast<const char*>(bytes), 2 + width) != 0) return P_ERR_IO;
+  if (m_trace) PLOVO_LIB_DBG("%s%lu", Indent().c_str(), static_cast<unsigned long>(number));
+  return 0;
+}
+
+int PStream::Send(Channel& ch, const std::string& text) {
+  // A longer string cannot state its length; refusing it before any byte
+  // leaves keeps the peer from reading the rest of the string as values.
+  if (text.size() > kMaxString) {
+    PLOVO_LIB_ERR("PStream: string of %zu bytes exceeds %zu", text.size(), kMaxString);
+    return P_ERR_INVALID_ARGUMENT;
+  }
+  unsigned char head[3] = {TAG_STRING, static_cast<unsigned char>(text.size() >> 8),
+                           static_cast<unsigned char>(text.size())};
+  if (ch.Write(reinterpret_cast<const char*>(head), sizeof(head)) != 0) return P_ERR_IO;
+  // A string may be longer than the channel's block; write it in blocks.
+  for (size_t at = 0; at < text.size(); at += PStream::kBlockSize) {
+    size_t n = std::min<size_t>(text.size() - at, PStream::kBlockSize);
+    if (ch.Write(text.data() + at, n) != 0) return P_ERR_IO;
+  }
+  if (m_trace) PLOVO_LIB_DBG("%s\"%s\"", Indent().c_str(), text.c_str());
+  return 0;
+}
+
+int PStream::Send(Channel& ch, const PObject::map_type& map) {
+  if (ch.WriteByte(TAG_MAP) != 0) return P_ERR_IO;
+  if (m_trace) PLOVO_LIB_DBG("%s{", Indent().c_str());
+  ++m_depth;
+  for (const auto& [key, value] : map) {
+    // One leading underscore marks a key that the peer knows without it.
+    std::string wireKey = !key.empty() && key[0] == '_' ? key.substr(1) : key;
+    int ret = Send(ch, wireKey);
+    if (ret != 0) {
+      --m_depth;
+      return ret;
+    }
+    PushHistory(wireKey);
+    ret = SendObject(ch, value);
+    if (ret != 0) {  // the failing key stays on the stack for DumpHistory
+      --m_depth;
+      return ret;
+    }
+    PopHistory();
+  }
+  --m_depth;
+  if (ch.WriteByte(TAG_END) != 0) return P_ERR_IO;
+  if (m_trace) PLOVO_LIB_DBG("%s}", Indent().c_str());
+  return 0;
+}
+
+int PStream::Send(Channel& ch, const PObject::array_type& array) {
+  if (ch.WriteByte(TAG_ARRAY) != 0) return P_ERR_IO;
+  if (m_trace) PLOVO_LIB_DBG("%s[", Indent().c_str());
+  ++m_depth;
+  for (const PObject& element : array) {
+    int ret = SendObject(ch, element);
+    if (ret != 0) {
+      --m_depth;
+      return ret;
+    }
+  }
+  --m_depth;
+  if (ch.WriteByte(TAG_END) != 0) return P_ERR_IO;
+  if (m_trace) PLOVO_LIB_DBG("%s]", Indent().c_str());
+  return 0;
+}
+
+int PStream::Send(Channel& ch, const PObject::binary_type& binary) {
+  if (ch.WriteByte(TAG_BINARY) != 0 || ch.WriteInt64(binary.length) != 0) return P_ERR_IO;
+  std::unique_ptr<char[]> buffer(new (std::nothrow) char[kBlockSize]);
+  if (!buffer) {
+    PLOVO_LIB_ERR("malloc error");
+    return P_ERR_INTERRUPTED;
+  }
+  File file(fopen(binary.path.c_str(), "rb"));
+  if (!file) {
+    PLOVO_LIB_ERR("fopen(%s) error", binary.path.c_str());
+    return P_ERR_INTERRUPTED;
+  }
+  if (fseeko(file.get(), static_cast<off_t>(binary.offset), SEEK_SET) != 0) {
+    PLOVO_LIB_ERR("fseek error");
+    return P_ERR_INTERRUPTED;
+  }
+  uint64_t sent = 0;
+  UpdateStatus(0, binary.length);
+  while (sent < binary.length) {
+    size_t want = static_cast<size_t>(std::min<uint64_t>(binary.length - sent, kBlockSize));
+    size_t got = fread(buffer.get(), 1, want, file.get());
+    if (got == 0) {
+      if (ferror(file.get())) {
+        PLOVO_LIB_ERR("fread error");
+        return P_ERR_INTERRUPTED;
+      }
+      break;  // the file ended early
+    }
+    if (ch.Write(buffer.get(), got) != 0) return P_ERR_IO;
+    sent += got;
+    UpdateStatus(sent, binary.length);
+    if (sent % kProgressStep == 0) {
+      PLOVO_LIB_INFO("sending %s ... (%lu / %lu)", binary.path.c_str(), static_cast<unsigned long>(sent),
+                     static_cast<unsigned long>(binary.length));
+    }
+  }
+  if (sent < binary.length) {
+    PLOVO_LIB_ERR("file length is incorrect.");
+    return P_ERR_TIMEOUT;
+  }
+  if (m_trace) PLOVO_LIB_DBG("%sbinary, %lu bytes", Indent().c_str(), static_cast<unsigned long>(binary.length));
+  return 0;
+}
+
+// ---- receiving ---------------------------------------------------------------
+
+int PStream::Recv(Channel& ch, PObject& target) {
+  m_trace = Plovo::LogWillWrite(LOG_DEBUG);
+  m_depth = 0;
+  int ret = RecvObject(ch, target);
+  if (ret != 0) DumpHistory();
+  ClearHistory();
+  return ret;
+}
+
+int PStream::RecvTag(Channel& ch, uint8_t& tag) {
+  int ret = ch.ReadByte(&tag);
+  if (ret != 0) {
+    PLOVO_LIB_ERR("Channel: %d", ret);
+    return P_ERR_IO;
+  }
+  return 0;
+}
+
+int PStream::RecvObject(Channel& ch, PObject& target) {
+  uint8_t tag = 0;
+  int ret = RecvTag(ch, tag);
+  return ret != 0 ? ret : RecvDispatch(ch, tag, target);
+}
+
+int PStream::RecvDispatch(Channel& ch, uint8_t tag, PObject& target) {
+  int ret;
+  switch (tag) {
+    case TAG_STRING: {
+      std::string text;
+      ret = Recv(ch, text);
+      if (ret == 0) target = text;
+      break;
+    }
+    case TAG_INTEGER: {
+      uint64_t number = 0;
+      ret = Recv(ch, number);
+      if (ret == 0) target = static_cast<unsigned long>(number);
+      break;
+    }
+    case TAG_MAP:
+      ret = Recv(ch, target.asMap());
+      break;
+    case TAG_ARRAY:
+      ret = Recv(ch, target.asArray());
+      break;
+    case TAG_BINARY:
+      ret = Recv(ch, target.asBinary());
+      break;
+    case TAG_NULL: {
+      uint8_t length = 0;
+      if (ch.ReadByte(&length) != 0) {
+        PLOVO_LIB_ERR("Channel: %d", P_ERR_IO);
+        return P_ERR_IO;
+      }
+      if (length != 0) {
+        PLOVO_LIB_ERR("expect length 0, but we've got %u", length);
+        return P_ERR_TIMEOUT;
+      }
+      target.clear();
+      return 0;
+    }
+    default:
+      PLOVO_LIB_ERR("PStream: unknown tag %u", tag);
+      return P_ERR_TIMEOUT;
+  }
+  return ret > 0 ? 0 : ret;
+}
+
+int PStream::Recv(Channel& ch, uint64_t& number) {
+  uint8_t width = 0;
+  int ret = ch.ReadByte(&width);
+  unsigned char bytes[255];
+  if (ret == 0) ret = ch.Read(reinterpret_cast<char*>(bytes), width);
+  if (ret != 0) {
+    PLOVO_LIB_ERR("Channel: %d", ret);
+    return P_ERR_IO;
+  }
+  number = 0;
+  for (unsigned i = 0; i < width; ++i) number = (number << 8) | bytes[i];
+  if (m_trace) PLOVO_LIB_DBG("%s%lu", Indent().c_str(), static_cast<unsigned long>(number));
+  return 0;
+}
+
+int PStream::Recv(Channel& ch, std::string& text) {
+  unsigned short length = 0;
+  int ret = ch.ReadInt16(&length);
+  if (ret == 0) {
+    text.resize(length);
+    // Read in blocks: a channel reads at most its capacity at a time.
+    for (size_t at = 0; ret == 0 && at < length; at += kBlockSize) {
+      ret = ch.Read(&text[at], std::min<size_t>(length - at, kBlockSize));
+    }
+  }
+  if (ret != 0) {
+    PLOVO_LIB_ERR("Channel: %d", ret);
+    return P_ERR_IO;
+  }
+  // The text ends at its first zero byte, as the peer's C strings do.
+  text.resize(strnlen(text.c_str(), length));
+  if (m_trace) PLOVO_LIB_DBG("%s\"%s\"", Indent().c_str(), text.c_str());
+  return 0;
+}
+
+int PStream::Recv(Channel& ch, PObject::map_type& map) {
+  if (m_depth >= kMaxDepth) {
+    PLOVO_LIB_ERR("PStream: containers nested deeper than %lu", static_cast<unsigned long>(kMaxDepth));
+    return P_ERR_TIMEOUT;
+  }
+  if (m_trace) PLOVO_LIB_DBG("%s{", Indent().c_str());
+  ++m_depth;
+  int ret = 0;
+  for (;;) {
+    uint8_t tag = 0;
+    ret = RecvTag(ch, tag);
+    if (ret != 0) break;
+    if (tag == TAG_END) break;
+    if (tag != TAG_STRING) {
+      PLOVO_LIB_ERR("PStream: expect string, but get tag %u", tag);
+      ret = P_ERR_TIMEOUT;
+      break;
+    }
+    std::string key;
+    ret = Recv(ch, key);
+    if (ret != 0) break;
+    PushHistory(key);
+    ret = RecvObject(ch, map[key]);
+    if (ret != 0) break;  // the key stays on the stack for DumpHistory
+    PopHistory();
+  }
+  --m_depth;
+  if (ret == 0 && m_trace) PLOVO_LIB_DBG("%s}", Indent().c_str());
+  return ret;
+}
+
+int PStream::Recv(Channel& ch, PObject::array_type& array) {
+  if (m_depth >= kMaxDepth) {
+    PLOVO_LIB_ERR("PStream: containers nested deeper than %lu", static_cast<unsigned long>(kMaxDepth));
+    return P_ERR_TIMEOUT;
+  }
+  if (m_trace) PLOVO_LIB_DBG("%s[", Indent().c_str());
+  ++m_depth;
+  int ret = 0;
+  for (;;) {
+    uint8_t tag = 0;
+    ret = RecvTag(ch, tag);
+    if (ret != 0 || tag == TAG_END) break;
+    array.emplace_back();
+    ret = RecvDispatch(ch, tag, array.back());
+    if (ret != 0) break;
+  }
+  --m_depth;
+  if (ret == 0 && m_trace) PLOVO_LIB_DBG("%s]", Indent().c_str());
+  return ret;
+}
+
+int PStream::Recv(Channel& ch, PObject::binary_type& binary) {
+  unsigned long length = 0;
+  int ret = ch.ReadInt64(&length);
+  if (ret != 0) {
+    PLOVO_LIB_ERR("Channel: %d", ret);
+    return P_ERR_IO;
+  }
+  const char* mode = "wb";
+  if (!binary.path.empty()) {
+    PLOVO_LIB_INFO("store binary to %s, offset %lu", binary.path.c_str(), static_cast<unsigned long>(binary.offset));
+    if (binary.offset != 0) {
+      // Resume: whatever follows the offset is stale and is replaced.
+      if (binary.length != binary.offset && truncate(binary.path.c_str(), static_cast<off_t>(binary.offset)) != 0) {
+        PLOVO_LIB_ERR("truncate: %s (%d)", strerror(errno), errno);
+        return P_ERR_INTERRUPTED;
+      }
+      mode = "ab";
+    }
+  } else {
+    binary.path = TmpNameGen::getInstance().getTmpPath(m_recv_location);
+    if (binary.path.empty()) return P_ERR_INTERRUPTED;
+    binary.offset = 0;
+    binary.length = 0;
+  }
+  std::unique_ptr<char[]> buffer(new (std::nothrow) char[kBlockSize]);
+  if (!buffer) {
+    PLOVO_LIB_ERR("malloc error");
+    return P_ERR_INTERRUPTED;
+  }
+  File file(fopen(binary.path.c_str(), mode));
+  if (!file) {
+    PLOVO_LIB_ERR("fopen(%s) error", binary.path.c_str());
+    return P_ERR_INTERRUPTED;
+  }
+  uint64_t stored = 0;
+  UpdateStatus(0, length);
+  ret = 0;
+  while (ret == 0 && stored < length) {
+    unsigned long want = static_cast<unsigned long>(std::min<uint64_t>(length - stored, kBlockSize));
+    unsigned long got = 0;
+    int read = ch.Read(buffer.get(), want, got);
+    // Bytes that did arrive are kept, so that a resumed transfer need not
+    // send them again.
+    if (got > 0 && fwrite(buffer.get(), 1, got, file.get()) != got) {
+      PLOVO_LIB_ERR("fwrite(%s): %s", binary.path.c_str(), strerror(errno));
+      ret = StoreError();
+      break;
+    }
+    stored += got;
+    UpdateStatus(stored, length);
+    if (read != 0) {
+      PLOVO_LIB_ERR("Channel: %d", read);
+      ret = P_ERR_IO;
+    } else if (stored % kProgressStep == 0) {
+      PLOVO_LIB_INFO("receiving %s ... (%lu / %lu)", binary.path.c_str(), static_cast<unsigned long>(stored),
+                     static_cast<unsigned long>(length));
+    }
+  }
+  if (fflush(file.get()) != 0 && ret == 0) {
+    PLOVO_LIB_ERR("fflush(%s): %s", binary.path.c_str(), strerror(errno));
+    ret = StoreError();
+  }
+  binary.length = binary.offset + stored;
+  if (ret == 0 && m_trace) {
+    PLOVO_LIB_DBG("%sbinary has been stored at '%s' with length %lu", Indent().c_str(), binary.path.c_str(),
+                  static_cast<unsigned long>(binary.length));
+  }
+  return ret;
+}
