@@ -19,6 +19,7 @@
 #include <chrono>
 #include <climits>
 #include <cstring>
+#include <mutex>
 
 #include "common/log.h"
 #include "ipc/error-code.h"
@@ -183,18 +184,68 @@ class SigPipeGuard {
   bool wasPending_ = false;
 };
 
+// A channel is made per command, and its two buffers are large enough that
+// the allocator hands them back to the system when they are freed and takes
+// fresh page faults when the next command allocates them: about a quarter
+// of a command's round trip. A few freed buffers are kept for the next
+// channel instead.
+class BufferCache {
+ public:
+  char* Take(unsigned long capacity) {
+    {
+      std::lock_guard<std::mutex> lock(mutex_);
+      for (size_t i = 0; i < count_; ++i) {
+        if (kept_[i].capacity == capacity) {
+          char* buffer = kept_[i].buffer;
+          kept_[i] = kept_[--count_];
+          return buffer;
+        }
+      }
+    }
+    return new char[capacity];
+  }
+  void Give(char* buffer, unsigned long capacity) {
+    {
+      std::lock_guard<std::mutex> lock(mutex_);
+      if (count_ < kKeep) {
+        kept_[count_++] = {buffer, capacity};
+        return;
+      }
+    }
+    delete[] buffer;
+  }
+
+ private:
+  static constexpr size_t kKeep = 8;  // four channels' worth
+  struct Kept {
+    char* buffer;
+    unsigned long capacity;
+  };
+  std::mutex mutex_;
+  Kept kept_[kKeep] = {};
+  size_t count_ = 0;
+};
+
+// Never destroyed, so that a channel released during static destruction
+// still finds it; what it keeps stays reachable.
+BufferCache& Buffers() {
+  static BufferCache* cache = new BufferCache;
+  return *cache;
+}
+
 }  // namespace
 
-Channel::Channel(unsigned long capacity) : m_capacity(capacity) {
-  m_wbuf = new char[capacity];
-  m_rbuf = new char[capacity];
+Channel::Channel(unsigned long capacity)
+    : m_capacity(capacity), m_trace(Plovo::LogWillWrite(LOG_DEBUG)) {
+  m_wbuf = Buffers().Take(capacity);
+  m_rbuf = Buffers().Take(capacity);
   SwitchChannelOp(1);
 }
 
 Channel::~Channel() {
   Close();
-  delete[] m_wbuf;
-  delete[] m_rbuf;
+  Buffers().Give(m_wbuf, m_capacity);
+  Buffers().Give(m_rbuf, m_capacity);
 }
 
 int Channel::Open(const char* path) {
@@ -219,14 +270,7 @@ int Channel::Open(const char* path) {
     close(fd);
     return P_ERR_SYSTEM;
   }
-  // A channel that was open is taken over, not refused; its old handle must
-  // not leak.
-  if (m_handle != nullptr) m_ops->destroy(*this);
-  m_ssl = false;
-  SwitchChannelOp(1);
-  m_handle = new int(fd);
-  ClearRead();
-  ClearWrite();
+  Adopt(fd);
   return P_SUCCESS;
 }
 
@@ -250,12 +294,8 @@ int Channel::Open(int fd, bool setOptions) {
       return P_ERR_SYSTEM;
     }
   }
-  if (m_handle != nullptr) m_ops->destroy(*this);  // a plain handle holding -1
-  SwitchChannelOp(1);
-  m_handle = new int(fd);
+  Adopt(fd);
   PLOVO_LIB_DBG("Channel: opening socket %d", fd);
-  ClearRead();
-  ClearWrite();
   return P_SUCCESS;
 }
 
@@ -271,13 +311,19 @@ int Channel::Open(const char* ip, int port) {
     close(fd);
     return P_ERR_IO;
   }
+  Adopt(fd);
+  return P_SUCCESS;
+}
+
+// Every Open ends here. A channel that was open is taken over, not refused
+// (only Open(fd) refuses it); its old handle must not leak.
+void Channel::Adopt(int fd) {
   if (m_handle != nullptr) m_ops->destroy(*this);
   m_ssl = false;
   SwitchChannelOp(1);
   m_handle = new int(fd);
   ClearRead();
   ClearWrite();
-  return P_SUCCESS;
 }
 
 int Channel::Close() {
@@ -339,90 +385,83 @@ int Channel::ConvertToSSLChannel(bool server) {
   return P_SUCCESS;
 }
 
-int Channel::ReadByte(unsigned char* value) {
-  // Small reads take the bytes straight from the ring when it holds them;
-  // the message decoder reads every tag and length this way.
-  if (m_rsize >= 1) {
-    RingTake(m_rbuf, m_capacity, m_rhead, m_rsize, value, 1);
+// Small reads and writes (every tag and length of a message) take their
+// bytes straight from the ring or put them straight into it when they can;
+// otherwise they go through Read and Write, which wait, flush and refuse a
+// closed channel.
+int Channel::TakeBytes(unsigned char* out, unsigned long n) {
+  if (m_rsize >= n) {
+    RingTake(m_rbuf, m_capacity, m_rhead, m_rsize, out, n);
     return P_SUCCESS;
   }
-  return Read(reinterpret_cast<char*>(value), 1);
+  return Read(reinterpret_cast<char*>(out), n);
 }
+
+int Channel::PutBytes(const unsigned char* in, unsigned long n) {
+  if (m_capacity - m_wsize >= n && !IsClosed()) {
+    RingPut(m_wbuf, m_capacity, m_whead, m_wsize, in, n);
+    return P_SUCCESS;
+  }
+  return Write(reinterpret_cast<const char*>(in), n);
+}
+
+namespace {
+
+template <typename T>
+T FromBigEndian(const unsigned char* b) {
+  T v = 0;
+  for (size_t i = 0; i < sizeof(T); ++i) v = static_cast<T>(v << 8 | b[i]);
+  return v;
+}
+
+template <typename T>
+void ToBigEndian(T value, unsigned char* b) {
+  for (size_t i = sizeof(T); i-- > 0; value = static_cast<T>(value >> 8)) b[i] = static_cast<unsigned char>(value);
+}
+
+}  // namespace
+
+int Channel::ReadByte(unsigned char* value) { return TakeBytes(value, 1); }
 
 int Channel::ReadInt16(unsigned short* value) {
   unsigned char b[2];
-  if (m_rsize >= sizeof(b)) {
-    RingTake(m_rbuf, m_capacity, m_rhead, m_rsize, b, sizeof(b));
-  } else if (int r = Read(reinterpret_cast<char*>(b), sizeof(b)); r != P_SUCCESS) {
-    return r;
-  }
-  *value = static_cast<unsigned short>(b[0] << 8 | b[1]);
-  return P_SUCCESS;
+  int r = TakeBytes(b, sizeof(b));
+  if (r == P_SUCCESS) *value = FromBigEndian<unsigned short>(b);
+  return r;
 }
 
 int Channel::ReadInt32(unsigned int* value) {
   unsigned char b[4];
-  if (m_rsize >= sizeof(b)) {
-    RingTake(m_rbuf, m_capacity, m_rhead, m_rsize, b, sizeof(b));
-  } else if (int r = Read(reinterpret_cast<char*>(b), sizeof(b)); r != P_SUCCESS) {
-    return r;
-  }
-  unsigned int v = 0;
-  for (unsigned char c : b) v = v << 8 | c;
-  *value = v;
-  return P_SUCCESS;
+  int r = TakeBytes(b, sizeof(b));
+  if (r == P_SUCCESS) *value = FromBigEndian<unsigned int>(b);
+  return r;
 }
 
 int Channel::ReadInt64(unsigned long* value) {
   unsigned char b[8];
-  if (m_rsize >= sizeof(b)) {
-    RingTake(m_rbuf, m_capacity, m_rhead, m_rsize, b, sizeof(b));
-  } else if (int r = Read(reinterpret_cast<char*>(b), sizeof(b)); r != P_SUCCESS) {
-    return r;
-  }
-  unsigned long v = 0;
-  for (unsigned char c : b) v = v << 8 | c;
-  *value = v;
-  return P_SUCCESS;
+  int r = TakeBytes(b, sizeof(b));
+  if (r == P_SUCCESS) *value = FromBigEndian<unsigned long>(b);
+  return r;
 }
 
-// The writers append straight to the ring when the bytes fit; a closed
-// channel must still refuse them, as Write does.
-int Channel::WriteByte(unsigned char value) {
-  if (m_capacity - m_wsize >= 1 && !IsClosed()) {
-    RingPut(m_wbuf, m_capacity, m_whead, m_wsize, &value, 1);
-    return P_SUCCESS;
-  }
-  return Write(reinterpret_cast<const char*>(&value), 1);
-}
+int Channel::WriteByte(unsigned char value) { return PutBytes(&value, 1); }
 
 int Channel::WriteInt16(unsigned short value) {
-  const unsigned char b[2] = {static_cast<unsigned char>(value >> 8), static_cast<unsigned char>(value)};
-  if (m_capacity - m_wsize >= sizeof(b) && !IsClosed()) {
-    RingPut(m_wbuf, m_capacity, m_whead, m_wsize, b, sizeof(b));
-    return P_SUCCESS;
-  }
-  return Write(reinterpret_cast<const char*>(b), sizeof(b));
+  unsigned char b[2];
+  ToBigEndian(value, b);
+  return PutBytes(b, sizeof(b));
 }
 
 int Channel::WriteInt32(unsigned int value) {
   unsigned char b[4];
-  for (int i = 3; i >= 0; --i, value >>= 8) b[i] = static_cast<unsigned char>(value);
-  if (m_capacity - m_wsize >= sizeof(b) && !IsClosed()) {
-    RingPut(m_wbuf, m_capacity, m_whead, m_wsize, b, sizeof(b));
-    return P_SUCCESS;
-  }
-  return Write(reinterpret_cast<const char*>(b), sizeof(b));
+  ToBigEndian(value, b);
+  return PutBytes(b, sizeof(b));
 }
 
 int Channel::WriteInt64(unsigned long value) {
   unsigned char b[8];
-  for (int i = 7; i >= 0; --i, value >>= 8) b[i] = static_cast<unsigned char>(value);
-  if (m_capacity - m_wsize >= sizeof(b) && !IsClosed()) {
-    RingPut(m_wbuf, m_capacity, m_whead, m_wsize, b, sizeof(b));
-    return P_SUCCESS;
-  }
-  return Write(reinterpret_cast<const char*>(b), sizeof(b));
+  ToBigEndian(value, b);
+  return PutBytes(b, sizeof(b));
 }
 
 int Channel::Read(char* buf, unsigned long n) {
@@ -463,7 +502,7 @@ int Channel::Read(char* buf, unsigned long n, unsigned long& got) {
     m_rhead = m_rsize == 0 ? 0 : take;
     if (r != P_SUCCESS) return r;
   }
-  PLOVO_LIB_DBG("Read: read %zd bytes, head = %zd, size = %zd", static_cast<ssize_t>(n),
+  if (m_trace) PLOVO_LIB_DBG("Read: read %zd bytes, head = %zd, size = %zd", static_cast<ssize_t>(n),
                 static_cast<ssize_t>(m_rhead), static_cast<ssize_t>(m_rsize));
   return P_SUCCESS;
 }
@@ -485,7 +524,7 @@ int Channel::Write(const char* data, unsigned long n) {
     }
   }
   RingPut(m_wbuf, m_capacity, m_whead, m_wsize, data, n);
-  PLOVO_LIB_DBG("Write: write %zd bytes", static_cast<ssize_t>(n));
+  if (m_trace) PLOVO_LIB_DBG("Write: write %zd bytes", static_cast<ssize_t>(n));
   return P_SUCCESS;
 }
 
@@ -512,7 +551,7 @@ int Channel::FlushWrite(unsigned long atLeast) {
       if (m_whead == m_capacity || m_wsize == 0) m_whead = 0;
       sent += n;
       if (sent >= target) {
-        PLOVO_LIB_DBG("FlushWrite: flush at least %zu bytes", static_cast<size_t>(atLeast));
+        if (m_trace) PLOVO_LIB_DBG("FlushWrite: flush at least %zu bytes", static_cast<size_t>(atLeast));
         return P_SUCCESS;
       }
       lastProgress = Clock::now();

@@ -5,6 +5,7 @@
 #include <cstring>
 #include <iterator>
 #include <stdexcept>
+#include <type_traits>
 #include <utility>
 
 static_assert(sizeof(PObject) == 2 * sizeof(void*), "a PObject is a tag and a pointer");
@@ -102,10 +103,11 @@ PObject::PObject(PObject&& other) noexcept : type_(other.type_), data_(other.dat
 }
 
 template <typename T>
-PObject& PObject::reset(const T& value) {
-  T* payload = new T(value);
+PObject& PObject::reset(T&& value) {
+  using V = std::decay_t<T>;
+  V* payload = new V(std::forward<T>(value));
   clear();
-  type_ = type_trait<T>::value;
+  type_ = type_trait<V>::value;
   data_ = payload;
   return *this;
 }
@@ -128,6 +130,7 @@ PObject& PObject::operator=(PObject&& other) noexcept {
 }
 
 PObject& PObject::operator=(const std::string& s) { return reset(s); }
+PObject& PObject::operator=(std::string&& s) { return reset(std::move(s)); }
 PObject& PObject::operator=(const char* s) { return reset(std::string(s)); }
 PObject& PObject::operator=(const buffer_type& b) { return reset(b); }
 PObject& PObject::operator=(const binary_type& b) { return reset(b); }
@@ -202,6 +205,11 @@ uint64_t PObject::asUInt64() const {
 
 bool PObject::asBool() const {
   return isInteger() ? asUInt64() != 0 : !isEmpty();
+}
+
+const std::string& PObject::asStringRef() const {
+  static const std::string empty;
+  return isString() ? *static_cast<const std::string*>(data_) : empty;
 }
 
 std::string PObject::asString() const {

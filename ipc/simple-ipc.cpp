@@ -27,6 +27,29 @@ sockaddr_in Loopback(int port) {
   return addr;
 }
 
+// A listening loopback TCP socket: bindTo binds it and returns the port
+// bound, or -1. Returns the descriptor or -1.
+template <typename BindTo>
+int ListenLoopback(BindTo bindTo) {
+  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
+  if (fd < 0) {
+    LogSysError("socket");
+    return -1;
+  }
+  int port = bindTo(fd);
+  if (port < 0) {
+    close(fd);
+    return -1;
+  }
+  if (listen(fd, kBacklog) != 0) {
+    LogSysError("listen");
+    close(fd);
+    return -1;
+  }
+  PLOVO_LIB_INFO("listening on port %d", port);
+  return fd;
+}
+
 }  // namespace
 
 // ---- IPCSender ---------------------------------------------------------------
@@ -66,23 +89,13 @@ int IPCListener::prepare(const std::string& path) {
 
 int IPCListener::prepare(int port) {
   close();
-  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
-  if (fd < 0) {
-    LogSysError("socket");
-    return -1;
-  }
-  int bound = do_bind(fd, port);
-  if (bound < 0) {
-    PLOVO_LIB_ERR("find available port failed.");
-    ::close(fd);
-    return -1;
-  }
-  if (listen(fd, kBacklog) != 0) {
-    LogSysError("listen");
-    ::close(fd);
-    return -1;
-  }
-  PLOVO_LIB_INFO("listening on port %d", bound);
+  int bound = -1;
+  int fd = ListenLoopback([&](int s) {
+    bound = do_bind(s, port);
+    if (bound < 0) PLOVO_LIB_ERR("find available port failed.");
+    return bound;
+  });
+  if (fd < 0) return -1;
   m_fd = fd;
   return bound;
 }
@@ -143,24 +156,14 @@ void IPCListener::close() {
 
 int IPCListener::OpenSocket(int port) {
   if (port < 1) return -1;
-  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
-  if (fd < 0) {
-    LogSysError("socket");
-    return -1;
-  }
-  sockaddr_in addr = Loopback(port);
-  if (bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
-    LogSysError("bind");
-    ::close(fd);
-    return -1;
-  }
-  if (listen(fd, kBacklog) != 0) {
-    LogSysError("listen");
-    ::close(fd);
-    return -1;
-  }
-  PLOVO_LIB_INFO("listening on port %d", port);
-  return fd;
+  return ListenLoopback([port](int s) {
+    sockaddr_in addr = Loopback(port);
+    if (bind(s, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
+      LogSysError("bind");
+      return -1;
+    }
+    return port;
+  });
 }
 
 int IPCListener::OpenDomainSocket(const std::string& path) {

@@ -38,9 +38,14 @@ void PStream::GetVersion(int& major, int& minor, int& patch) {
 
 // ---- error stack and progress ------------------------------------------------
 
-void PStream::PushHistory(const std::string& key) {
+void PStream::PushHistory() {
   std::lock_guard<std::mutex> lock(m_mutex);
-  m_history.push_back(key);
+  m_history.emplace_back();
+}
+
+void PStream::SetHistoryTop(std::string_view key) {
+  std::lock_guard<std::mutex> lock(m_mutex);
+  m_history.back() = key;
 }
 
 void PStream::PopHistory() {
@@ -50,7 +55,8 @@ void PStream::PopHistory() {
 
 std::string PStream::JoinHistory() const {
   std::string joined;
-  for (const std::string& key : m_history) {
+  for (std::string_view key : m_history) {
+    if (key.empty()) continue;  // a container that had no key yet
     if (!joined.empty()) joined += '.';
     joined += key;
   }
@@ -111,7 +117,7 @@ int PStream::Send(Channel& ch, const PObject& value) {
 int PStream::SendObject(Channel& ch, const PObject& value) {
   if (value.isNull()) return SendNull(ch);
   if (value.isInteger()) return Send(ch, value.asUInt64());
-  if (value.isString()) return Send(ch, value.asString());
+  if (value.isString()) return Send(ch, std::string_view(value.asStringRef()));
   if (value.isMap()) return Send(ch, value.asMap());
   if (value.isArray()) return Send(ch, value.asArray());
   if (value.isBinary()) return Send(ch, value.asBinary());
@@ -135,7 +141,7 @@ int PStream::Send(Channel& ch, uint64_t number) {
   return 0;
 }
 
-int PStream::Send(Channel& ch, const std::string& text) {
+int PStream::Send(Channel& ch, std::string_view text) {
   // A longer string cannot state its length; refusing it before any byte
   // leaves keeps the peer from reading the rest of the string as values.
   if (text.size() > kMaxString) {
@@ -150,7 +156,7 @@ int PStream::Send(Channel& ch, const std::string& text) {
     size_t n = std::min<size_t>(text.size() - at, PStream::kBlockSize);
     if (ch.Write(text.data() + at, n) != 0) return P_ERR_IO;
   }
-  if (m_trace) PLOVO_LIB_DBG("%s\"%s\"", Indent().c_str(), text.c_str());
+  if (m_trace) PLOVO_LIB_DBG("%s\"%.*s\"", Indent().c_str(), static_cast<int>(text.size()), text.data());
   return 0;
 }
 
@@ -158,22 +164,20 @@ int PStream::Send(Channel& ch, const PObject::map_type& map) {
   if (ch.WriteByte(TAG_MAP) != 0) return P_ERR_IO;
   if (m_trace) PLOVO_LIB_DBG("%s{", Indent().c_str());
   ++m_depth;
+  PushHistory();
   for (const auto& [key, value] : map) {
     // One leading underscore marks a key that the peer knows without it.
-    std::string wireKey = !key.empty() && key[0] == '_' ? key.substr(1) : key;
+    std::string_view wireKey = key;
+    if (!wireKey.empty() && wireKey[0] == '_') wireKey.remove_prefix(1);
+    SetHistoryTop(wireKey);
     int ret = Send(ch, wireKey);
-    if (ret != 0) {
-      --m_depth;
-      return ret;
-    }
-    PushHistory(wireKey);
-    ret = SendObject(ch, value);
+    if (ret == 0) ret = SendObject(ch, value);
     if (ret != 0) {  // the failing key stays on the stack for DumpHistory
       --m_depth;
       return ret;
     }
-    PopHistory();
   }
+  PopHistory();
   --m_depth;
   if (ch.WriteByte(TAG_END) != 0) return P_ERR_IO;
   if (m_trace) PLOVO_LIB_DBG("%s}", Indent().c_str());
@@ -209,6 +213,7 @@ int PStream::Send(Channel& ch, const PObject::binary_type& binary) {
     PLOVO_LIB_ERR("fopen(%s) error", binary.path.c_str());
     return P_ERR_INTERRUPTED;
   }
+  setvbuf(file.get(), nullptr, _IONBF, 0);  // whole blocks; stdio's buffer would split them
   if (fseeko(file.get(), static_cast<off_t>(binary.offset), SEEK_SET) != 0) {
     PLOVO_LIB_ERR("fseek error");
     return P_ERR_INTERRUPTED;
@@ -273,7 +278,7 @@ int PStream::RecvDispatch(Channel& ch, uint8_t tag, PObject& target) {
     case TAG_STRING: {
       std::string text;
       ret = Recv(ch, text);
-      if (ret == 0) target = text;
+      if (ret == 0) target = std::move(text);
       break;
     }
     case TAG_INTEGER: {
@@ -354,6 +359,7 @@ int PStream::Recv(Channel& ch, PObject::map_type& map) {
   if (m_trace) PLOVO_LIB_DBG("%s{", Indent().c_str());
   ++m_depth;
   int ret = 0;
+  PushHistory();
   for (;;) {
     uint8_t tag = 0;
     ret = RecvTag(ch, tag);
@@ -367,11 +373,15 @@ int PStream::Recv(Channel& ch, PObject::map_type& map) {
     std::string key;
     ret = Recv(ch, key);
     if (ret != 0) break;
-    PushHistory(key);
-    ret = RecvObject(ch, map[key]);
+    // Keys arrive in the map's order, so a new key normally goes last; the
+    // hint saves the search. A key already present is merged into.
+    auto member = !map.empty() && map.rbegin()->first < key ? map.emplace_hint(map.end(), std::move(key), PObject())
+                                                            : map.try_emplace(std::move(key)).first;
+    SetHistoryTop(member->first);
+    ret = RecvObject(ch, member->second);
     if (ret != 0) break;  // the key stays on the stack for DumpHistory
-    PopHistory();
   }
+  if (ret == 0) PopHistory();
   --m_depth;
   if (ret == 0 && m_trace) PLOVO_LIB_DBG("%s}", Indent().c_str());
   return ret;
@@ -432,6 +442,7 @@ int PStream::Recv(Channel& ch, PObject::binary_type& binary) {
     PLOVO_LIB_ERR("fopen(%s) error", binary.path.c_str());
     return P_ERR_INTERRUPTED;
   }
+  setvbuf(file.get(), nullptr, _IONBF, 0);  // one write per block
   uint64_t stored = 0;
   UpdateStatus(0, length);
   ret = 0;

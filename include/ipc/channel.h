@@ -136,6 +136,9 @@ class Channel {
   static void TlsDestroy(Channel& ch);
   static bool TlsClosed(const Channel& ch);
 
+  void Adopt(int fd);
+  int TakeBytes(unsigned char* out, unsigned long n);
+  int PutBytes(const unsigned char* in, unsigned long n);
   int InitSSL(SSL** ssl, SSL_CTX** ctx, bool server);
   int SSLHandshake(SSL* ssl, timeval interval, unsigned int limit);
   static void DeinitSSL(SSL** ssl, SSL_CTX** ctx, bool quiet);
@@ -157,6 +160,9 @@ class Channel {
   int* m_flag = nullptr;
   bool m_ssl = false;
   bool m_allow_untrust = true;
+  // Whether the per-call debug lines are written; decided once per channel
+  // so that a server that masks them out pays nothing for them.
+  bool m_trace;
 };
 
 #endif

@@ -104,6 +104,8 @@ class PObject {
   PObject& operator=(const PObject& other);
   PObject& operator=(PObject&& other) noexcept;
   PObject& operator=(const std::string& s);
+  // Takes the text without copying it.
+  PObject& operator=(std::string&& s);
   PObject& operator=(const char* s);
   PObject& operator=(const buffer_type& b);
   PObject& operator=(const binary_type& b);
@@ -155,6 +157,8 @@ class PObject {
   // A string's text; an integer's low 32 bits in decimal; otherwise "".
   // Values of 2^32 and more print truncated on purpose: do not widen it.
   std::string asString() const;
+  // A string's text without a copy; the empty string for other kinds.
+  const std::string& asStringRef() const;
 
   // The payload, or the matching shared empty object for another kind.
   const map_type& asMap() const;
@@ -192,7 +196,7 @@ class PObject {
   // built before the old one is released, so the source may live inside
   // this value.
   template <typename T>
-  PObject& reset(const T& value);
+  PObject& reset(T&& value);
   const PObject* nthMapEntry(int n) const;
 
   uint32_t type_;

@@ -29,6 +29,7 @@
 #include <cstdint>
 #include <mutex>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "ipc/channel.h"
@@ -87,7 +88,7 @@ class PStream {
  private:
   int SendObject(Channel& ch, const PObject& value);
   int SendNull(Channel& ch);
-  int Send(Channel& ch, const std::string& text);
+  int Send(Channel& ch, std::string_view text);
   int Send(Channel& ch, uint64_t number);
   int Send(Channel& ch, const PObject::binary_type& binary);
   int Send(Channel& ch, const PObject::map_type& map);
@@ -102,12 +103,17 @@ class PStream {
   int Recv(Channel& ch, PObject::map_type& map);
   int Recv(Channel& ch, PObject::array_type& array);
 
-  void PushHistory(const std::string& key);
+  // The stack holds views of the keys inside the value being sent or
+  // received, which outlives the exchange; it is emptied before Send and
+  // Recv return. A container pushes one slot and sets it to each key in
+  // turn, so that a key costs one lock, not two.
+  void PushHistory();
+  void SetHistoryTop(std::string_view key);
   void PopHistory();
   std::string JoinHistory() const;  // caller holds m_mutex
   std::string Indent() const;
 
-  std::vector<std::string> m_history;
+  std::vector<std::string_view> m_history;
   uint64_t m_done = 0;
   uint64_t m_total = 0;
   std::mutex m_mutex;

@@ -1,0 +1,112 @@
+#include "bench-support.h"
+
+#include <errno.h>
+#include <ftw.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+namespace plovo_bench {
+namespace {
+
+[[noreturn]] void Die(const std::string& what) {
+  std::fprintf(stderr, "bench: %s: %s\n", what.c_str(), std::strerror(errno));
+  std::exit(2);
+}
+
+int RemoveEntry(const char* path, const struct stat*, int, struct FTW*) {
+  if (remove(path) != 0 && errno != ENOENT) std::fprintf(stderr, "bench: remove %s: %s\n", path, std::strerror(errno));
+  return 0;
+}
+
+}  // namespace
+
+Sandbox::Sandbox() {
+  const char* given = std::getenv("PLOVO_ROOT");
+  if (given != nullptr && given[0] != '\0') {
+    root_ = given;
+  } else {
+    // Short on purpose: the daemon socket path must fit in 107 bytes.
+    char name[] = "/tmp/plovo-bench-XXXXXX";
+    if (mkdtemp(name) == nullptr) Die("mkdtemp");
+    root_ = name;
+    owned_ = true;
+    if (setenv("PLOVO_ROOT", root_.c_str(), 1) != 0) Die("setenv PLOVO_ROOT");
+  }
+  MakeDirs(root_ + "/tmp");
+}
+
+Sandbox::~Sandbox() {
+  if (owned_) RemoveTree(root_);
+}
+
+bool SendAll(int fd, const char* data, size_t n) {
+  while (n > 0) {
+    ssize_t w = send(fd, data, n, MSG_NOSIGNAL);
+    if (w < 0 && errno == EINTR) continue;
+    if (w <= 0) return false;
+    data += w;
+    n -= static_cast<size_t>(w);
+  }
+  return true;
+}
+
+void UseServerLogMask() { setlogmask(LOG_UPTO(LOG_INFO)); }
+
+void RemoveTree(const std::string& path) {
+  nftw(path.c_str(), RemoveEntry, 16, FTW_DEPTH | FTW_PHYS);
+}
+
+void MakeDirs(const std::string& path) {
+  for (size_t at = 1; at <= path.size(); ++at) {
+    if (at != path.size() && path[at] != '/') continue;
+    std::string prefix = path.substr(0, at);
+    if (mkdir(prefix.c_str(), 0755) != 0 && errno != EEXIST) Die("mkdir " + prefix);
+  }
+}
+
+SummaryReporter::SummaryReporter()
+    : ConsoleReporter(isatty(STDOUT_FILENO) ? OO_ColorTabular : OO_Tabular) {}
+
+void SummaryReporter::ReportRuns(const std::vector<Run>& runs) {
+  for (const Run& run : runs) {
+    if (run.error_occurred) continue;
+    // With repetitions the median aggregate stands for the benchmark; a
+    // benchmark run once has only its one result.
+    bool median = run.run_type == Run::RT_Aggregate && run.aggregate_name == "median";
+    bool single = run.run_type == Run::RT_Iteration && run.repetitions <= 1;
+    if (!median && !single) continue;
+    seconds_[run.run_name.function_name] = run.GetAdjustedRealTime() / benchmark::GetTimeUnitMultiplier(run.time_unit);
+  }
+  ConsoleReporter::ReportRuns(runs);
+}
+
+std::optional<double> SummaryReporter::MedianSeconds(const std::string& name) const {
+  auto found = seconds_.find(name);
+  if (found == seconds_.end()) return std::nullopt;
+  return found->second;
+}
+
+void RunBenchmarks(int argc, char** argv, SummaryReporter& reporter) {
+  // The default goes first so that a flag on the command line overrides it.
+  std::vector<char*> args;
+  static char interleave[] = "--benchmark_enable_random_interleaving=true";
+  args.push_back(argv[0]);
+  args.push_back(interleave);
+  for (int i = 1; i < argc; ++i) args.push_back(argv[i]);
+  int count = static_cast<int>(args.size());
+  args.push_back(nullptr);
+  benchmark::Initialize(&count, args.data());
+  if (benchmark::ReportUnrecognizedArguments(count, args.data())) std::exit(1);
+  benchmark::RunSpecifiedBenchmarks(&reporter);
+  benchmark::Shutdown();
+}
+
+const char* Verdict(bool met) { return met ? "met" : "MISSED"; }
+
+}  // namespace plovo_bench
