@@ -18,14 +18,17 @@ namespace {
 
 // Received files (binaries without a destination) land here and are
 // removed after every input.
-const std::string& ScratchDir() {
-  static const std::string dir = [] {
-    char templ[] = "/tmp/plovo-fuzz-XXXXXX";
-    const char* made = mkdtemp(templ);
-    if (made == nullptr) abort();
-    return std::string(made);
+// A plain array, so that it is still there when the exit handler runs.
+char gScratch[] = "/tmp/plovo-fuzz-XXXXXX";
+
+std::string ScratchDir() {
+  static const bool made = [] {
+    if (mkdtemp(gScratch) == nullptr) abort();
+    atexit([] { rmdir(gScratch); });  // emptied after every input
+    return true;
   }();
-  return dir;
+  (void)made;
+  return gScratch;
 }
 
 void EmptyScratchDir() {

@@ -392,6 +392,10 @@ int Channel::ConvertToSSLChannel(bool server) {
 int Channel::TakeBytes(unsigned char* out, unsigned long n) {
   if (m_rsize >= n) {
     RingTake(m_rbuf, m_capacity, m_rhead, m_rsize, out, n);
+    if (m_trace) {
+      PLOVO_LIB_DBG("Read: read %zd bytes, head = %zd, size = %zd", static_cast<ssize_t>(n),
+                    static_cast<ssize_t>(m_rhead), static_cast<ssize_t>(m_rsize));
+    }
     return P_SUCCESS;
   }
   return Read(reinterpret_cast<char*>(out), n);
@@ -400,6 +404,7 @@ int Channel::TakeBytes(unsigned char* out, unsigned long n) {
 int Channel::PutBytes(const unsigned char* in, unsigned long n) {
   if (m_capacity - m_wsize >= n && !IsClosed()) {
     RingPut(m_wbuf, m_capacity, m_whead, m_wsize, in, n);
+    if (m_trace) PLOVO_LIB_DBG("Write: write %zd bytes", static_cast<ssize_t>(n));
     return P_SUCCESS;
   }
   return Write(reinterpret_cast<const char*>(in), n);
@@ -782,7 +787,11 @@ long Channel::TlsRead(Channel& ch, char* buf, unsigned long n) {
   SSL* ssl = static_cast<SSL*>(ch.m_handle);
   for (bool waited = false;; waited = true) {
     ERR_clear_error();
-    int r = SSL_read(ssl, buf, ClampToInt(n));
+    int r;
+    {
+      SigPipeGuard guard;  // a read may answer the peer (alerts, key updates)
+      r = SSL_read(ssl, buf, ClampToInt(n));
+    }
     if (r > 0) return r;
     int error = SSL_get_error(ssl, r);
     if (error != SSL_ERROR_WANT_READ && error != SSL_ERROR_WANT_WRITE) {

@@ -1,5 +1,7 @@
 #include "ipc/daemon-ipc.h"
 
+#include <utility>
+
 #include "common/log.h"
 #include "common/paths.h"
 #include "ipc/simple-ipc.h"
@@ -31,7 +33,8 @@ int DaemonIPC::SendCommand(const PObject& request, PObject& response) {
     PLOVO_LIB_ERR("SendCommand error: %s", response["error"].toString().c_str());
     return -1;
   }
-  if (response["ack"].asString() == "ok") {
+  // Read through a const view: the caller's answer must not gain an "ack".
+  if (std::as_const(response)["ack"].asString() == "ok") {
     PLOVO_LIB_DBG("Recieve ack.");
     return 0;
   }

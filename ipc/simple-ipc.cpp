@@ -2,7 +2,7 @@
 
 #include <arpa/inet.h>
 #include <netinet/in.h>
-#include <sys/select.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
@@ -121,15 +121,14 @@ int IPCListener::do_bind(int fd, int firstPort) {
 
 bool IPCListener::isReady() {
   if (m_fd < 0) return false;
-  fd_set readable;
-  FD_ZERO(&readable);
-  FD_SET(m_fd, &readable);
-  timeval timeout = m_timeout;  // select() may change it
+  // poll(), not select(): the server may hold descriptors past FD_SETSIZE.
+  pollfd p{m_fd, POLLIN, 0};
+  int timeoutMs = static_cast<int>(m_timeout.tv_sec * 1000 + m_timeout.tv_usec / 1000);
   int n;
   do {
-    n = select(m_fd + 1, &readable, nullptr, nullptr, &timeout);
+    n = poll(&p, 1, timeoutMs);
   } while (n < 0 && errno == EINTR);
-  return n > 0 && FD_ISSET(m_fd, &readable);
+  return n > 0 && (p.revents & POLLIN) != 0;
 }
 
 int IPCListener::accept() {

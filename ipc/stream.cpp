@@ -26,7 +26,14 @@ struct FileCloser {
 using File = std::unique_ptr<FILE, FileCloser>;
 
 // The receiver's mapping of a failed write to its file.
-int StoreError() { return errno == ENOSPC ? P_ERR_INVALID_ARGUMENT : P_ERR_INTERRUPTED; }
+int StoreError(int error) { return error == ENOSPC ? P_ERR_INVALID_ARGUMENT : P_ERR_INTERRUPTED; }
+
+// Every channel failure ends the value with -2, after naming the channel's
+// own code.
+int ChannelFailure(int code) {
+  PLOVO_LIB_ERR("Channel: %d", code);
+  return P_ERR_IO;
+}
 
 }  // namespace
 
@@ -56,7 +63,7 @@ void PStream::PopHistory() {
 std::string PStream::JoinHistory() const {
   std::string joined;
   for (std::string_view key : m_history) {
-    if (key.empty()) continue;  // a container that had no key yet
+    if (key.data() == nullptr) continue;  // a container that had no key yet
     if (!joined.empty()) joined += '.';
     joined += key;
   }
@@ -127,7 +134,8 @@ int PStream::SendObject(Channel& ch, const PObject& value) {
 
 int PStream::SendNull(Channel& ch) {
   static const char kNull[2] = {TAG_NULL, 0};
-  return ch.Write(kNull, sizeof(kNull)) == 0 ? 0 : P_ERR_IO;
+  int r = ch.Write(kNull, sizeof(kNull));
+  return r == 0 ? 0 : ChannelFailure(r);
 }
 
 int PStream::Send(Channel& ch, uint64_t number) {
@@ -136,7 +144,7 @@ int PStream::Send(Channel& ch, uint64_t number) {
   bytes[0] = TAG_INTEGER;
   bytes[1] = static_cast<unsigned char>(width);
   for (unsigned i = 0; i < width; ++i) bytes[2 + i] = static_cast<unsigned char>(number >> (8 * (width - 1 - i)));
-  if (ch.Write(reinterpret_cast<const char*>(bytes), 2 + width) != 0) return P_ERR_IO;
+  if (int r = ch.Write(reinterpret_cast<const char*>(bytes), 2 + width); r != 0) return ChannelFailure(r);
   if (m_trace) PLOVO_LIB_DBG("%s%lu", Indent().c_str(), static_cast<unsigned long>(number));
   return 0;
 }
@@ -150,18 +158,19 @@ int PStream::Send(Channel& ch, std::string_view text) {
   }
   unsigned char head[3] = {TAG_STRING, static_cast<unsigned char>(text.size() >> 8),
                            static_cast<unsigned char>(text.size())};
-  if (ch.Write(reinterpret_cast<const char*>(head), sizeof(head)) != 0) return P_ERR_IO;
+  if (int r = ch.Write(reinterpret_cast<const char*>(head), sizeof(head)); r != 0) return ChannelFailure(r);
   // A string may be longer than the channel's block; write it in blocks.
-  for (size_t at = 0; at < text.size(); at += PStream::kBlockSize) {
-    size_t n = std::min<size_t>(text.size() - at, PStream::kBlockSize);
-    if (ch.Write(text.data() + at, n) != 0) return P_ERR_IO;
+  const size_t block = std::min<size_t>(kBlockSize, ch.Capacity());
+  for (size_t at = 0; at < text.size(); at += block) {
+    size_t n = std::min(text.size() - at, block);
+    if (int r = ch.Write(text.data() + at, n); r != 0) return ChannelFailure(r);
   }
   if (m_trace) PLOVO_LIB_DBG("%s\"%.*s\"", Indent().c_str(), static_cast<int>(text.size()), text.data());
   return 0;
 }
 
 int PStream::Send(Channel& ch, const PObject::map_type& map) {
-  if (ch.WriteByte(TAG_MAP) != 0) return P_ERR_IO;
+  if (int r = ch.WriteByte(TAG_MAP); r != 0) return ChannelFailure(r);
   if (m_trace) PLOVO_LIB_DBG("%s{", Indent().c_str());
   ++m_depth;
   PushHistory();
@@ -179,13 +188,13 @@ int PStream::Send(Channel& ch, const PObject::map_type& map) {
   }
   PopHistory();
   --m_depth;
-  if (ch.WriteByte(TAG_END) != 0) return P_ERR_IO;
+  if (int r = ch.WriteByte(TAG_END); r != 0) return ChannelFailure(r);
   if (m_trace) PLOVO_LIB_DBG("%s}", Indent().c_str());
   return 0;
 }
 
 int PStream::Send(Channel& ch, const PObject::array_type& array) {
-  if (ch.WriteByte(TAG_ARRAY) != 0) return P_ERR_IO;
+  if (int r = ch.WriteByte(TAG_ARRAY); r != 0) return ChannelFailure(r);
   if (m_trace) PLOVO_LIB_DBG("%s[", Indent().c_str());
   ++m_depth;
   for (const PObject& element : array) {
@@ -196,13 +205,13 @@ int PStream::Send(Channel& ch, const PObject::array_type& array) {
     }
   }
   --m_depth;
-  if (ch.WriteByte(TAG_END) != 0) return P_ERR_IO;
+  if (int r = ch.WriteByte(TAG_END); r != 0) return ChannelFailure(r);
   if (m_trace) PLOVO_LIB_DBG("%s]", Indent().c_str());
   return 0;
 }
 
 int PStream::Send(Channel& ch, const PObject::binary_type& binary) {
-  if (ch.WriteByte(TAG_BINARY) != 0 || ch.WriteInt64(binary.length) != 0) return P_ERR_IO;
+  if (int r = ch.WriteByte(TAG_BINARY) != 0 || ch.WriteInt64(binary.length); r != 0) return ChannelFailure(r);
   std::unique_ptr<char[]> buffer(new (std::nothrow) char[kBlockSize]);
   if (!buffer) {
     PLOVO_LIB_ERR("malloc error");
@@ -218,10 +227,11 @@ int PStream::Send(Channel& ch, const PObject::binary_type& binary) {
     PLOVO_LIB_ERR("fseek error");
     return P_ERR_INTERRUPTED;
   }
+  const uint64_t block = std::min<uint64_t>(kBlockSize, ch.Capacity());
   uint64_t sent = 0;
   UpdateStatus(0, binary.length);
   while (sent < binary.length) {
-    size_t want = static_cast<size_t>(std::min<uint64_t>(binary.length - sent, kBlockSize));
+    size_t want = static_cast<size_t>(std::min(binary.length - sent, block));
     size_t got = fread(buffer.get(), 1, want, file.get());
     if (got == 0) {
       if (ferror(file.get())) {
@@ -230,7 +240,7 @@ int PStream::Send(Channel& ch, const PObject::binary_type& binary) {
       }
       break;  // the file ended early
     }
-    if (ch.Write(buffer.get(), got) != 0) return P_ERR_IO;
+    if (int r = ch.Write(buffer.get(), got); r != 0) return ChannelFailure(r);
     sent += got;
     UpdateStatus(sent, binary.length);
     if (sent % kProgressStep == 0) {
@@ -259,11 +269,7 @@ int PStream::Recv(Channel& ch, PObject& target) {
 
 int PStream::RecvTag(Channel& ch, uint8_t& tag) {
   int ret = ch.ReadByte(&tag);
-  if (ret != 0) {
-    PLOVO_LIB_ERR("Channel: %d", ret);
-    return P_ERR_IO;
-  }
-  return 0;
+  return ret == 0 ? 0 : ChannelFailure(ret);
 }
 
 int PStream::RecvObject(Channel& ch, PObject& target) {
@@ -298,10 +304,7 @@ int PStream::RecvDispatch(Channel& ch, uint8_t tag, PObject& target) {
       break;
     case TAG_NULL: {
       uint8_t length = 0;
-      if (ch.ReadByte(&length) != 0) {
-        PLOVO_LIB_ERR("Channel: %d", P_ERR_IO);
-        return P_ERR_IO;
-      }
+      if (int r = ch.ReadByte(&length); r != 0) return ChannelFailure(r);
       if (length != 0) {
         PLOVO_LIB_ERR("expect length 0, but we've got %u", length);
         return P_ERR_TIMEOUT;
@@ -321,10 +324,7 @@ int PStream::Recv(Channel& ch, uint64_t& number) {
   int ret = ch.ReadByte(&width);
   unsigned char bytes[255];
   if (ret == 0) ret = ch.Read(reinterpret_cast<char*>(bytes), width);
-  if (ret != 0) {
-    PLOVO_LIB_ERR("Channel: %d", ret);
-    return P_ERR_IO;
-  }
+  if (ret != 0) return ChannelFailure(ret);
   number = 0;
   for (unsigned i = 0; i < width; ++i) number = (number << 8) | bytes[i];
   if (m_trace) PLOVO_LIB_DBG("%s%lu", Indent().c_str(), static_cast<unsigned long>(number));
@@ -341,10 +341,7 @@ int PStream::Recv(Channel& ch, std::string& text) {
       ret = ch.Read(&text[at], std::min<size_t>(length - at, kBlockSize));
     }
   }
-  if (ret != 0) {
-    PLOVO_LIB_ERR("Channel: %d", ret);
-    return P_ERR_IO;
-  }
+  if (ret != 0) return ChannelFailure(ret);
   // The text ends at its first zero byte, as the peer's C strings do.
   text.resize(strnlen(text.c_str(), length));
   if (m_trace) PLOVO_LIB_DBG("%s\"%s\"", Indent().c_str(), text.c_str());
@@ -408,73 +405,89 @@ int PStream::Recv(Channel& ch, PObject::array_type& array) {
   return ret;
 }
 
-int PStream::Recv(Channel& ch, PObject::binary_type& binary) {
-  unsigned long length = 0;
-  int ret = ch.ReadInt64(&length);
-  if (ret != 0) {
-    PLOVO_LIB_ERR("Channel: %d", ret);
-    return P_ERR_IO;
-  }
+namespace {
+
+// Opens the file a received binary goes to: the target's own file (re-created
+// at offset 0; cut to the offset and appended to when resuming), or a new
+// temporary file in location when the target names none.
+int OpenRecvFile(PObject::binary_type& binary, const std::string& location, File& file) {
   const char* mode = "wb";
   if (!binary.path.empty()) {
     PLOVO_LIB_INFO("store binary to %s, offset %lu", binary.path.c_str(), static_cast<unsigned long>(binary.offset));
     if (binary.offset != 0) {
       // Resume: whatever follows the offset is stale and is replaced.
       if (binary.length != binary.offset && truncate(binary.path.c_str(), static_cast<off_t>(binary.offset)) != 0) {
-        PLOVO_LIB_ERR("truncate: %s (%d)", strerror(errno), errno);
+        int error = errno;
+        PLOVO_LIB_ERR("truncate: %s (%d)", strerror(error), error);
         return P_ERR_INTERRUPTED;
       }
       mode = "ab";
     }
   } else {
-    binary.path = TmpNameGen::getInstance().getTmpPath(m_recv_location);
-    if (binary.path.empty()) return P_ERR_INTERRUPTED;
+    binary.path = TmpNameGen::getInstance().getTmpPath(location);
     binary.offset = 0;
-    binary.length = 0;
+    if (binary.path.empty()) return P_ERR_INTERRUPTED;
   }
-  std::unique_ptr<char[]> buffer(new (std::nothrow) char[kBlockSize]);
-  if (!buffer) {
-    PLOVO_LIB_ERR("malloc error");
-    return P_ERR_INTERRUPTED;
-  }
-  File file(fopen(binary.path.c_str(), mode));
+  file.reset(fopen(binary.path.c_str(), mode));
   if (!file) {
     PLOVO_LIB_ERR("fopen(%s) error", binary.path.c_str());
     return P_ERR_INTERRUPTED;
   }
   setvbuf(file.get(), nullptr, _IONBF, 0);  // one write per block
+  return 0;
+}
+
+}  // namespace
+
+int PStream::Recv(Channel& ch, PObject::binary_type& binary) {
+  unsigned long length = 0;
   uint64_t stored = 0;
-  UpdateStatus(0, length);
-  ret = 0;
-  while (ret == 0 && stored < length) {
-    unsigned long want = static_cast<unsigned long>(std::min<uint64_t>(length - stored, kBlockSize));
-    unsigned long got = 0;
-    int read = ch.Read(buffer.get(), want, got);
-    // Bytes that did arrive are kept, so that a resumed transfer need not
-    // send them again.
-    if (got > 0 && fwrite(buffer.get(), 1, got, file.get()) != got) {
-      PLOVO_LIB_ERR("fwrite(%s): %s", binary.path.c_str(), strerror(errno));
-      ret = StoreError();
-      break;
-    }
-    stored += got;
-    UpdateStatus(stored, length);
-    if (read != 0) {
-      PLOVO_LIB_ERR("Channel: %d", read);
-      ret = P_ERR_IO;
-    } else if (stored % kProgressStep == 0) {
-      PLOVO_LIB_INFO("receiving %s ... (%lu / %lu)", binary.path.c_str(), static_cast<unsigned long>(stored),
-                     static_cast<unsigned long>(length));
-    }
-  }
-  if (fflush(file.get()) != 0 && ret == 0) {
-    PLOVO_LIB_ERR("fflush(%s): %s", binary.path.c_str(), strerror(errno));
-    ret = StoreError();
-  }
+  File file;
+  int ret = ch.ReadInt64(&length);
+  if (ret != 0) ret = ChannelFailure(ret);
+  if (ret == 0) ret = OpenRecvFile(binary, m_recv_location, file);
+  if (ret == 0) ret = StoreBinary(ch, file.get(), binary.path, length, stored);
+  // In every outcome the target says how much of its file holds what was
+  // sent, so that a later transfer can resume from there.
   binary.length = binary.offset + stored;
   if (ret == 0 && m_trace) {
     PLOVO_LIB_DBG("%sbinary has been stored at '%s' with length %lu", Indent().c_str(), binary.path.c_str(),
                   static_cast<unsigned long>(binary.length));
   }
   return ret;
+}
+
+int PStream::StoreBinary(Channel& ch, FILE* file, const std::string& path, uint64_t length, uint64_t& stored) {
+  std::unique_ptr<char[]> buffer(new (std::nothrow) char[kBlockSize]);
+  if (!buffer) {
+    PLOVO_LIB_ERR("malloc error");
+    return P_ERR_INTERRUPTED;
+  }
+  const uint64_t block = std::min<uint64_t>(kBlockSize, ch.Capacity());
+  UpdateStatus(0, length);
+  while (stored < length) {
+    unsigned long got = 0;
+    int read = ch.Read(buffer.get(), static_cast<unsigned long>(std::min(length - stored, block)), got);
+    // Bytes that did arrive are kept, so that a resumed transfer need not
+    // send them again.
+    size_t written = got > 0 ? fwrite(buffer.get(), 1, got, file) : 0;
+    stored += written;
+    UpdateStatus(stored, length);
+    if (written != got) {
+      int error = errno;
+      PLOVO_LIB_ERR("fwrite(%s): %s", path.c_str(), strerror(error));
+      return StoreError(error);
+    }
+    if (read != 0) return ChannelFailure(read);
+    if (stored % kProgressStep == 0) {
+      PLOVO_LIB_INFO("receiving %s ... (%lu / %lu)", path.c_str(), static_cast<unsigned long>(stored),
+                     static_cast<unsigned long>(length));
+    }
+  }
+  if (fflush(file) != 0) {
+    int error = errno;
+    PLOVO_LIB_ERR("fflush(%s): %s", path.c_str(), strerror(error));
+    return StoreError(error);
+  }
+  return 0;
 }

@@ -84,6 +84,8 @@ class Channel {
   // unknown. Returns 0 (also on a closed channel) or -3.
   virtual int GetPeerInfo(std::string& ip, int& port) const;
   virtual bool IsClosed() const;
+  // The size of each buffer: the largest block one Write accepts.
+  unsigned long Capacity() const { return m_capacity; }
 
   // TLS settings. The paths are shared by all channels.
   void SetAllowUntrust(bool allow) { m_allow_untrust = allow; }

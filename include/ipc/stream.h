@@ -27,6 +27,7 @@
 #define PLOVO_IPC_STREAM_H
 
 #include <cstdint>
+#include <cstdio>
 #include <mutex>
 #include <string>
 #include <string_view>
@@ -100,6 +101,8 @@ class PStream {
   int Recv(Channel& ch, std::string& text);
   int Recv(Channel& ch, uint64_t& number);
   int Recv(Channel& ch, PObject::binary_type& binary);
+  // Copies length bytes from the channel into file, counting them in stored.
+  int StoreBinary(Channel& ch, FILE* file, const std::string& path, uint64_t length, uint64_t& stored);
   int Recv(Channel& ch, PObject::map_type& map);
   int Recv(Channel& ch, PObject::array_type& array);
 

@@ -78,6 +78,7 @@ TEST_F(DaemonIPCTest, TheAnswerDecides) {
   EXPECT_TRUE(log.Contains(LOG_ERR, "SendCommand error: \"busy\"")) << log.Dump();
   EXPECT_EQ(r2["error_code"].asInt32(), 3);
   EXPECT_EQ(DaemonIPC().SendCommand(Command("c"), r3), -1);
+  EXPECT_EQ(r3.toString(), "{\"task_id\": 1}");  // the answer is left as it came
 }
 
 TEST_F(DaemonIPCTest, BrokenAnswersFailTheCommand) {
