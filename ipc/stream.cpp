@@ -348,11 +348,16 @@ int PStream::Recv(Channel& ch, std::string& text) {
   return 0;
 }
 
+// Refuses one more container level past the limit, so that a hostile peer
+// cannot exhaust the caller's stack.
+bool PStream::TooDeep() const {
+  if (m_depth < kMaxDepth) return false;
+  PLOVO_LIB_ERR("PStream: containers nested deeper than %lu", static_cast<unsigned long>(kMaxDepth));
+  return true;
+}
+
 int PStream::Recv(Channel& ch, PObject::map_type& map) {
-  if (m_depth >= kMaxDepth) {
-    PLOVO_LIB_ERR("PStream: containers nested deeper than %lu", static_cast<unsigned long>(kMaxDepth));
-    return P_ERR_TIMEOUT;
-  }
+  if (TooDeep()) return P_ERR_TIMEOUT;
   if (m_trace) PLOVO_LIB_DBG("%s{", Indent().c_str());
   ++m_depth;
   int ret = 0;
@@ -385,10 +390,7 @@ int PStream::Recv(Channel& ch, PObject::map_type& map) {
 }
 
 int PStream::Recv(Channel& ch, PObject::array_type& array) {
-  if (m_depth >= kMaxDepth) {
-    PLOVO_LIB_ERR("PStream: containers nested deeper than %lu", static_cast<unsigned long>(kMaxDepth));
-    return P_ERR_TIMEOUT;
-  }
+  if (TooDeep()) return P_ERR_TIMEOUT;
   if (m_trace) PLOVO_LIB_DBG("%s[", Indent().c_str());
   ++m_depth;
   int ret = 0;

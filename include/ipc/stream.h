@@ -115,6 +115,7 @@ class PStream {
   void PopHistory();
   std::string JoinHistory() const;  // caller holds m_mutex
   std::string Indent() const;
+  bool TooDeep() const;
 
   std::vector<std::string_view> m_history;
   uint64_t m_done = 0;
