@@ -2,6 +2,8 @@
 #ifndef PLOVO_COMMON_UTILITY_H
 #define PLOVO_COMMON_UTILITY_H
 
+#include <json/value.h>
+
 #include <string>
 #include <type_traits>
 
@@ -16,6 +18,10 @@ std::string NumToString(T value) {
     return std::to_string(value);
   }
 }
+
+// Compact JSON text of a value: no indentation, no line breaks, no final
+// newline.
+std::string JsonToString(const Json::Value& value);
 
 }  // namespace Plovo
 

@@ -6,6 +6,8 @@
 
 #include <sys/stat.h>
 
+#include <json/value.h>
+
 #include <string>
 
 namespace velt_dev {
@@ -29,6 +31,11 @@ bool FaultHit(const char* call, const char* file, int line);
 // Reads the whole file into *out and, when st is not null, its stat.
 // Returns 0 or the errno of the failing step.
 int ReadWholeFile(const std::string& path, std::string* out, struct stat* st);
+
+// Reads the JSON document of the state file StateDir() + "/" + name, in
+// strict mode. Returns 1 when read, 0 when the file is missing, and -1 when
+// it cannot be read or is not valid JSON.
+int ReadJsonState(const std::string& name, Json::Value* root);
 
 }  // namespace velt_dev
 

@@ -4,11 +4,14 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <json/reader.h>
+
 #include <atomic>
 #include <cerrno>
 #include <cstdlib>
 #include <map>
 #include <mutex>
+#include <sstream>
 #include <string>
 
 #include "dev-internal.h"
@@ -105,6 +108,22 @@ int ReadWholeFile(const std::string& path, std::string* out, struct stat* st) {
   }
   close(fd);
   return result;
+}
+
+int ReadJsonState(const std::string& name, Json::Value* root) {
+  std::string text;
+  int err = ReadWholeFile(StateDir() + "/" + name, &text, nullptr);
+  if (err == ENOENT) return 0;
+  if (err != 0) return -1;
+  Json::CharReaderBuilder builder;
+  Json::CharReaderBuilder::strictMode(&builder.settings_);
+  std::string errors;
+  std::istringstream in(text);
+  try {
+    return Json::parseFromStream(builder, in, root, &errors) ? 1 : -1;
+  } catch (const std::exception&) {
+    return -1;
+  }
 }
 
 }  // namespace velt_dev

@@ -1,15 +1,11 @@
 // Volumes, declared in velt-dev/volumes.json under the sandbox root.
 #include "velt/mount.h"
 
-#include <json/reader.h>
 #include <json/value.h>
 #include <sys/statvfs.h>
 
-#include <cerrno>
 #include <cstdlib>
 #include <cstring>
-#include <memory>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -91,25 +87,10 @@ bool ParseVolume(const Json::Value& entry, Volume* vol) {
 // volume. Sets the last error on failure.
 bool LoadVolumes(std::vector<Volume>* volumes) {
   volumes->clear();
-  std::string text;
-  int err = velt_dev::ReadWholeFile(velt_dev::StateDir() + "/volumes.json", &text, nullptr);
-  if (err == ENOENT) return true;
-  if (err != 0) {
-    VELT_FAIL(VLIBC_ERR_BAD_CONFIG);
-    return false;
-  }
-  Json::CharReaderBuilder builder;
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
   Json::Value root;
-  std::string errors;
-  std::istringstream in(text);
-  bool parsed;
-  try {
-    parsed = Json::parseFromStream(builder, in, &root, &errors);
-  } catch (const std::exception&) {
-    parsed = false;
-  }
-  if (!parsed || !root.isObject() || !(root["volumes"].isNull() || root["volumes"].isArray())) {
+  int read = velt_dev::ReadJsonState("volumes.json", &root);
+  if (read == 0) return true;
+  if (read < 0 || !root.isObject() || !(root["volumes"].isNull() || root["volumes"].isArray())) {
     VELT_FAIL(VLIBC_ERR_BAD_CONFIG);
     return false;
   }
