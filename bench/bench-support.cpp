@@ -7,17 +7,16 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <fcntl.h>
+
+#include <algorithm>
 #include <cstdio>
+#include <memory>
 #include <cstdlib>
 #include <cstring>
 
 namespace plovo_bench {
 namespace {
-
-[[noreturn]] void Die(const std::string& what) {
-  std::fprintf(stderr, "bench: %s: %s\n", what.c_str(), std::strerror(errno));
-  std::exit(2);
-}
 
 int RemoveEntry(const char* path, const struct stat*, int, struct FTW*) {
   if (remove(path) != 0 && errno != ENOENT) std::fprintf(stderr, "bench: remove %s: %s\n", path, std::strerror(errno));
@@ -25,6 +24,75 @@ int RemoveEntry(const char* path, const struct stat*, int, struct FTW*) {
 }
 
 }  // namespace
+
+void Die(const std::string& what) {
+  std::fprintf(stderr, "%s: %s: %s\n", program_invocation_short_name, what.c_str(), std::strerror(errno));
+  std::exit(2);
+}
+
+bool WriteAll(int fd, const char* data, size_t n) {
+  while (n > 0) {
+    ssize_t w = write(fd, data, n);
+    if (w < 0 && errno == EINTR) continue;
+    if (w <= 0) return false;
+    data += w;
+    n -= static_cast<size_t>(w);
+  }
+  return true;
+}
+
+std::string DataDir(const Sandbox& sandbox, const std::string& name) {
+  const char* given = std::getenv("PLOVO_BENCH_DATA_DIR");
+  std::string dir = given != nullptr && given[0] != '\0' ? given : sandbox.Root() + "/" + name;
+  MakeDirs(dir);
+  return dir;
+}
+
+void PrepareRandomFile(const std::string& path, uint64_t size) {
+  constexpr size_t kChunkWords = size_t{1} << 17;  // 1 MiB
+  struct stat st {};
+  if (stat(path.c_str(), &st) != 0 || static_cast<uint64_t>(st.st_size) != size) {
+    int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+    if (fd < 0) Die("create " + path);
+    std::unique_ptr<uint64_t[]> chunk(new uint64_t[kChunkWords]);
+    uint64_t x = 0x9E3779B97F4A7C15ull;
+    for (uint64_t done = 0; done < size; done += sizeof(uint64_t) * kChunkWords) {
+      for (size_t i = 0; i < kChunkWords; ++i) {
+        x ^= x << 13;
+        x ^= x >> 7;
+        x ^= x << 17;
+        chunk[i] = x;
+      }
+      size_t n = static_cast<size_t>(std::min<uint64_t>(size - done, sizeof(uint64_t) * kChunkWords));
+      if (!WriteAll(fd, reinterpret_cast<const char*>(chunk.get()), n)) Die("write " + path);
+    }
+    if (fsync(fd) != 0 || close(fd) != 0) Die("flush " + path);
+  }
+  int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0) Die("open " + path);
+  std::unique_ptr<char[]> buffer(new char[1 << 20]);
+  while (read(fd, buffer.get(), 1 << 20) > 0) {
+  }
+  close(fd);
+}
+
+bool SameContent(const std::string& a, const std::string& b) {
+  int fa = open(a.c_str(), O_RDONLY | O_CLOEXEC);
+  int fb = open(b.c_str(), O_RDONLY | O_CLOEXEC);
+  bool same = fa >= 0 && fb >= 0;
+  std::unique_ptr<char[]> x(new char[1 << 20]);
+  std::unique_ptr<char[]> y(new char[1 << 20]);
+  while (same) {
+    ssize_t n = read(fa, x.get(), 1 << 20);
+    ssize_t m = read(fb, y.get(), 1 << 20);
+    if (n != m || n < 0) same = false;
+    if (n <= 0) break;
+    same = memcmp(x.get(), y.get(), static_cast<size_t>(n)) == 0;
+  }
+  if (fa >= 0) close(fa);
+  if (fb >= 0) close(fb);
+  return same;
+}
 
 Sandbox::Sandbox() {
   const char* given = std::getenv("PLOVO_ROOT");

@@ -6,6 +6,7 @@
 
 #include <benchmark/benchmark.h>
 
+#include <cstdint>
 #include <map>
 #include <optional>
 #include <string>
@@ -39,6 +40,25 @@ void UseServerLogMask();
 
 // Sends all n bytes on a blocking socket; false when the peer is gone.
 bool SendAll(int fd, const char* data, size_t n);
+
+// Prints "<program>: <what>: <errno text>" and exits with status 2.
+[[noreturn]] void Die(const std::string& what);
+
+// Writes all n bytes to a file; false on a write error.
+bool WriteAll(int fd, const char* data, size_t n);
+
+// The folder for a benchmark's large files: PLOVO_BENCH_DATA_DIR when set
+// (scripts/bench puts it in memory when there is room), else
+// <sandbox root>/<name>. Made when missing.
+std::string DataDir(const Sandbox& sandbox, const std::string& name);
+
+// Makes path a file of size pseudo-random bytes (so that no layer can
+// profit from zero pages) unless a file of that size is there, flushes it,
+// then reads it through once so that it sits in the page cache.
+void PrepareRandomFile(const std::string& path, uint64_t size);
+
+// Whether the two files hold the same bytes.
+bool SameContent(const std::string& a, const std::string& b);
 
 // Removes a folder and everything under it; a missing folder is no error.
 void RemoveTree(const std::string& path);

@@ -43,72 +43,10 @@ std::string gSource;
 std::string gDestination;
 const char* gCp = "/bin/cp";
 
-[[noreturn]] void Die(const std::string& what) {
-  std::fprintf(stderr, "file-copy-bench: %s: %s\n", what.c_str(), std::strerror(errno));
-  std::exit(2);
-}
-
-bool WriteAll(int fd, const char* data, size_t n) {
-  while (n > 0) {
-    ssize_t w = write(fd, data, n);
-    if (w < 0 && errno == EINTR) continue;
-    if (w <= 0) return false;
-    data += w;
-    n -= static_cast<size_t>(w);
-  }
-  return true;
-}
-
-// Pseudo-random bytes, so that no layer can profit from zero pages, made
-// unless a file of the right size is there; then read through once.
-void PrepareSource() {
-  struct stat st {};
-  if (stat(gSource.c_str(), &st) != 0 || static_cast<uint64_t>(st.st_size) != kFileSize) {
-    int fd = open(gSource.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-    if (fd < 0) Die("create " + gSource);
-    std::unique_ptr<uint64_t[]> chunk(new uint64_t[1 << 17]);  // 1 MiB
-    uint64_t x = 0x9E3779B97F4A7C15ull;
-    for (uint64_t done = 0; done < kFileSize; done += 8 << 17) {
-      for (size_t i = 0; i < (1 << 17); ++i) {
-        x ^= x << 13;
-        x ^= x >> 7;
-        x ^= x << 17;
-        chunk[i] = x;
-      }
-      if (!WriteAll(fd, reinterpret_cast<const char*>(chunk.get()), 8 << 17)) Die("write " + gSource);
-    }
-    if (fsync(fd) != 0 || close(fd) != 0) Die("flush " + gSource);
-  }
-  int fd = open(gSource.c_str(), O_RDONLY | O_CLOEXEC);
-  if (fd < 0) Die("open " + gSource);
-  std::unique_ptr<char[]> buffer(new char[1 << 20]);
-  while (read(fd, buffer.get(), 1 << 20) > 0) {
-  }
-  close(fd);
-}
-
-bool SameContent() {
-  int a = open(gSource.c_str(), O_RDONLY | O_CLOEXEC);
-  int b = open(gDestination.c_str(), O_RDONLY | O_CLOEXEC);
-  bool same = a >= 0 && b >= 0;
-  std::unique_ptr<char[]> x(new char[1 << 20]);
-  std::unique_ptr<char[]> y(new char[1 << 20]);
-  while (same) {
-    ssize_t n = read(a, x.get(), 1 << 20);
-    ssize_t m = read(b, y.get(), 1 << 20);
-    if (n != m || n < 0) same = false;
-    if (n <= 0) break;
-    same = same && memcmp(x.get(), y.get(), static_cast<size_t>(n)) == 0;
-  }
-  if (a >= 0) close(a);
-  if (b >= 0) close(b);
-  return same;
-}
-
 // The file system the figures are for.
 std::string FileSystemName(const std::string& dir, bool* inMemory) {
   struct statfs fs {};
-  if (statfs(dir.c_str(), &fs) != 0) Die("statfs " + dir);
+  if (statfs(dir.c_str(), &fs) != 0) plovo_bench::Die("statfs " + dir);
   long type = static_cast<long>(fs.f_type);
   *inMemory = type == kTmpfsMagic || type == kRamfsMagic;
   switch (type) {
@@ -152,7 +90,7 @@ template <typename Copy>
 void TimeCopies(benchmark::State& state, Copy copy) {
   for (auto _ : state) {
     state.PauseTiming();
-    if (unlink(gDestination.c_str()) != 0 && errno != ENOENT) Die("unlink " + gDestination);
+    if (unlink(gDestination.c_str()) != 0 && errno != ENOENT) plovo_bench::Die("unlink " + gDestination);
     state.ResumeTiming();
     if (!copy()) {
       state.SkipWithError("copy failed");
@@ -160,7 +98,7 @@ void TimeCopies(benchmark::State& state, Copy copy) {
     }
   }
   state.SetBytesProcessed(static_cast<int64_t>(state.iterations() * kFileSize));
-  if (!SameContent()) state.SkipWithError("destination differs from source");
+  if (!plovo_bench::SameContent(gSource, gDestination)) state.SkipWithError("destination differs from source");
   unlink(gDestination.c_str());
 }
 
@@ -190,19 +128,17 @@ double MiBps(double seconds) { return static_cast<double>(kFileSize) / seconds /
 int main(int argc, char** argv) {
   plovo_bench::UseServerLogMask();
   plovo_bench::Sandbox sandbox;
-  const char* dataDir = std::getenv("PLOVO_BENCH_DATA_DIR");
-  std::string dir = dataDir != nullptr && dataDir[0] != '\0' ? dataDir : sandbox.Root() + "/file-copy";
-  plovo_bench::MakeDirs(dir);
+  const std::string dir = plovo_bench::DataDir(sandbox, "file-copy");
   gSource = dir + "/copy-source.bin";
   gDestination = dir + "/copy-destination.bin";
   if (access(gCp, X_OK) != 0) gCp = "/usr/bin/cp";
-  if (access(gCp, X_OK) != 0) Die("no cp in /bin or /usr/bin");
+  if (access(gCp, X_OK) != 0) plovo_bench::Die("no cp in /bin or /usr/bin");
   bool inMemory = false;
   std::string fsName = FileSystemName(dir, &inMemory);
   std::printf("file-copy-bench: files in %s (%s, %s), cp is %s\n", dir.c_str(), fsName.c_str(),
               inMemory ? "in memory" : "disk-backed", gCp);
   std::fflush(stdout);
-  PrepareSource();
+  plovo_bench::PrepareRandomFile(gSource, kFileSize);
 
   Register("fscopy", BM_FSCopy);
   Register("cp", BM_Cp);

@@ -129,9 +129,30 @@ bool CopyInKernel(int in, int out) {
   }
 }
 
+struct FreeDeleter {
+  void operator()(char* p) const { std::free(p); }
+};
+
+// A descriptor closed when the owner goes, unless released first.
+struct Fd {
+  explicit Fd(int n) : fd(n) {}
+  ~Fd() {
+    if (fd >= 0) close(fd);
+  }
+  Fd(const Fd&) = delete;
+  Fd& operator=(const Fd&) = delete;
+  int release() {
+    int n = fd;
+    fd = -1;
+    return n;
+  }
+  int fd;
+};
+
 // The copy through one 32 MiB buffer. 0, -1 or -2 (destination full).
 int CopyWithBuffer(int in, int out) {
-  char* buffer = static_cast<char*>(std::malloc(kCopyBufferSize));
+  std::unique_ptr<char, FreeDeleter> owned(static_cast<char*>(std::malloc(kCopyBufferSize)));
+  char* buffer = owned.get();
   if (!buffer) {
     int err = errno;
     PLOVO_LIB_ERR("FSCopy: malloc(%d): %s (%d)", static_cast<int>(kCopyBufferSize),
@@ -165,7 +186,6 @@ int CopyWithBuffer(int in, int out) {
     }
     if (result != 0) break;
   }
-  std::free(buffer);
   return result;
 }
 
@@ -228,10 +248,6 @@ bool IsFileExist(const std::string& path) {
 }
 
 int FSChown(const std::string& path, unsigned uid, unsigned gid) {
-  if (static_cast<uid_t>(uid) == static_cast<uid_t>(-1) &&
-      static_cast<gid_t>(gid) == static_cast<gid_t>(-1)) {
-    return 0;  // nothing to change; also spares a caller without the right a failure
-  }
   if (chown(path.c_str(), static_cast<uid_t>(uid), static_cast<gid_t>(gid)) != 0) {
     int err = errno;
     PLOVO_LIB_ERR("FSChown: chown(%s, %d, %d): %s (%d)", path.c_str(), static_cast<int>(uid),
@@ -248,10 +264,11 @@ int FSMKDirP(const std::string& path, unsigned uid, unsigned gid) {
   for (size_t at = path.find('/', 1);; at = path.find('/', at + 1)) {
     std::string prefix = at == std::string::npos ? path : path.substr(0, at);
     if (!prefix.empty() && prefix.back() != '/') {
-      if (mkdir(prefix.c_str(), 0777) == 0) {
+      int err = mkdir(prefix.c_str(), 0777) == 0 ? 0 : errno;
+      if (err == 0) {
         FSChown(prefix, uid, gid);
-      } else if (errno != EEXIST || !IsFolder(prefix)) {
-        int err = errno == EEXIST ? ENOTDIR : errno;
+      } else if (err != EEXIST || !IsFolder(prefix)) {
+        if (err == EEXIST) err = ENOTDIR;
         PLOVO_LIB_ERR("FSMKDirP: mkdir(%s): %s (%d)", prefix.c_str(), ErrText(err).text, err);
         return -1;
       }
@@ -288,8 +305,8 @@ int FSMKDir(const std::string& path, bool recursive, unsigned uid, unsigned gid)
 // fails (a destination that is not a regular file, such as a device, goes
 // to the buffer at once).
 int FSCopy(const std::string& source, const std::string& destination, bool removeSource) {
-  int in = open(source.c_str(), O_RDONLY | O_CLOEXEC);
-  if (in < 0) {
+  Fd in(open(source.c_str(), O_RDONLY | O_CLOEXEC));
+  if (in.fd < 0) {
     int err = errno;
     PLOVO_LIB_ERR("CopyFile: open(%s): %s (%d)", source.c_str(), ErrText(err).text, err);
     return -1;
@@ -297,24 +314,22 @@ int FSCopy(const std::string& source, const std::string& destination, bool remov
   // Opening a file onto itself would truncate it before the first byte is
   // read; refuse before anything is lost.
   struct stat inStat, outStat;
-  bool haveIn = fstat(in, &inStat) == 0;
+  bool haveIn = fstat(in.fd, &inStat) == 0;
   if (haveIn && stat(destination.c_str(), &outStat) == 0 && inStat.st_dev == outStat.st_dev &&
       inStat.st_ino == outStat.st_ino) {
     PLOVO_LIB_ERR("FSCopy: '%s' and '%s' are the same file", source.c_str(), destination.c_str());
-    close(in);
     return -1;
   }
   int out = open(destination.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666);
   if (out < 0) {
     int err = errno;
     PLOVO_LIB_ERR("CopyFile: open(%s): %s (%d)", destination.c_str(), ErrText(err).text, err);
-    close(in);
     return -1;
   }
   bool regularOut = fstat(out, &outStat) == 0 && S_ISREG(outStat.st_mode);
   bool kernel = haveIn && S_ISREG(inStat.st_mode) && regularOut;
-  int result = kernel && CopyInKernel(in, out) ? 0 : CopyWithBuffer(in, out);
-  close(in);
+  int result = kernel && CopyInKernel(in.fd, out) ? 0 : CopyWithBuffer(in.fd, out);
+  close(in.release());
 
   // A file system that allocates at write-back may find the disk full only
   // now; for a move the source must not go while the copy is in doubt.
@@ -398,8 +413,13 @@ int FSRename(const std::string& source, const std::string& destination) {
     return -3;
   }
   std::vector<std::string> names;
-  if (ListNames(source, &names) != 0) {
-    PLOVO_LIB_ERR("Failed to open dir '%s'", source.c_str());
+  int listed = ListNames(source, &names);
+  if (listed != 0) {
+    if (listed == -1) {
+      PLOVO_LIB_ERR("Failed to open dir '%s'", source.c_str());
+    } else {
+      PLOVO_LIB_ERR("Failed to read dir '%s'", source.c_str());
+    }
     return -3;
   }
   for (const std::string& name : names) {

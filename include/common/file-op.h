@@ -62,10 +62,11 @@ int FSChown(const std::string& path, unsigned uid, unsigned gid);
 // 0666 before the umask), then removes the source when removeSource is set.
 // The kernel copies where it can (copy_file_range, else sendfile); a 32 MiB
 // buffer, allocated per call, takes over where it cannot (pipes, devices).
-// -2 when the destination's disk is full (the partial file is left), -1 for
-// every other failure, including a destination that is the source itself.
-// The destination is fsynced before it is closed, and the source removed
-// only after that succeeded.
+// -2 when the destination's disk is full (the partial file is left; a write
+// that takes no byte counts as full), -1 for every other failure, including
+// a destination that is the source itself (refused before it is truncated).
+// The destination is fsynced before it is closed, a failing fsync or close
+// fails the copy, and the source is removed only after both succeeded.
 int FSCopy(const std::string& source, const std::string& destination, bool removeSource);
 
 // Removes a file or a whole folder tree, with the platform's extended
@@ -85,7 +86,9 @@ int FSRemove(const std::string& path, bool flag);
 int FSRename(const std::string& source, const std::string& destination);
 
 // Calls callback on path itself, then on each entry beneath it, a folder
-// before its contents; symbolic links are reported, not followed. A
+// before its contents; symbolic links are reported, not followed. An entry
+// whose kind the file system does not report is looked up, so that a
+// folder is always walked into rather than reported as a file. A
 // non-zero answer of the callback stops the walk with -2; path missing or
 // not a folder gives -1.
 int TraverseDir(const std::string& path, int (*callback)(const std::string& path, void* context),

@@ -1,6 +1,7 @@
 #include "common/file-op.h"
 
 #include <fcntl.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -9,6 +10,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <random>
@@ -132,6 +134,28 @@ TEST_F(FileOpTest, CopyOntoAFullDeviceGivesMinusTwoAndKeepsTheSource) {
   LogCapture log;
   EXPECT_EQ(FSCopy(Path("/src"), "/dev/full", true), -2);
   EXPECT_TRUE(log.Contains(LOG_ERR, "CopyFile: write: No space left on device (28)")) << log.Dump();
+  EXPECT_TRUE(Exists("/src"));
+}
+
+// A real full disk: a 1 MiB tmpfs mounted in the sandbox. The kernel copy
+// runs out of room part-way; what it wrote stays.
+TEST_F(FileOpTest, CopyOntoAFullFileSystemLeavesThePartialFile) {
+  MakeDir("/small");
+  if (mount("tmpfs", Path("/small").c_str(), "tmpfs", 0, "size=1m") != 0) {
+    GTEST_SKIP() << "cannot mount a tmpfs here: " << std::strerror(errno);
+  }
+  struct Unmount {
+    std::string path;
+    ~Unmount() { umount2(path.c_str(), MNT_DETACH); }
+  } unmount{Path("/small")};
+  WriteFile("/src", Bytes(3 << 20, 4));
+  LogCapture log;
+  EXPECT_EQ(FSCopy(Path("/src"), Path("/small/copy"), true), -2);
+  EXPECT_TRUE(log.Contains(LOG_ERR, "No space left on device (28)")) << log.Dump();
+  struct stat st;
+  ASSERT_EQ(stat(Path("/small/copy").c_str(), &st), 0);
+  EXPECT_GT(st.st_size, 0);
+  EXPECT_LT(st.st_size, 3 << 20);
   EXPECT_TRUE(Exists("/src"));
 }
 

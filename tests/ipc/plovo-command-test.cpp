@@ -124,6 +124,7 @@ class CreateTaskTest : public plovo_test::SandboxTest {
   void SetUp() override {
     SandboxTest::SetUp();
     MakeDir("/usbshare1");
+    MakeDir("/usbshare2");
     WriteFile("/dev/usb1", "");
     Declare(R"("shares": [{"name": "usbshare1", "dev_path": "dev/usb1"},
                           {"name": "usbshare2", "mounted": false, "dev_path": "dev/usb1"}],
