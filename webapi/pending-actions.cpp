@@ -9,18 +9,6 @@ void PlovoHandle::NotAvailableYet(const char* action) {
   response->SetError(401);
 }
 
-void PlovoHandle::List() { NotAvailableYet(__func__); }
-void PlovoHandle::Create() { NotAvailableYet(__func__); }
-void PlovoHandle::Get() { NotAvailableYet(__func__); }
-void PlovoHandle::GetFilter() { NotAvailableYet(__func__); }
-void PlovoHandle::SetSetting() { NotAvailableYet(__func__); }
-void PlovoHandle::SetTriggerTime() { NotAvailableYet(__func__); }
-void PlovoHandle::SetFilter() { NotAvailableYet(__func__); }
-void PlovoHandle::Delete() { NotAvailableYet(__func__); }
-void PlovoHandle::Run() { NotAvailableYet(__func__); }
-void PlovoHandle::Cancel() { NotAvailableYet(__func__); }
-void PlovoHandle::Enable() { NotAvailableYet(__func__); }
-void PlovoHandle::Disable() { NotAvailableYet(__func__); }
 void PlovoHandle::GetGlobalSetting() { NotAvailableYet(__func__); }
 void PlovoHandle::SetGlobalSetting() { NotAvailableYet(__func__); }
 void PlovoHandle::GetLogList() { NotAvailableYet(__func__); }

@@ -13,11 +13,22 @@
 
 #include <velt/webapi.h>
 
+#include <json/value.h>
+
+#include <cstdint>
 #include <string>
+#include <vector>
 
 #include "common/export.h"
+#include "common/registry.h"
 
 class PObject;
+
+namespace Plovo {
+struct TaskSetting;
+struct TriggerTimeSetting;
+struct FilterSetting;
+}  // namespace Plovo
 
 // The method table: 15 rows of {"VELT.Plovo", 1, method, Process}, closed by
 // a row whose api is null. Lives for the whole process.
@@ -47,6 +58,47 @@ class PlovoHandle {
   // match), or answers 401 "Unknown request".
   void HandleAction();
 
+  // The task enumerations as the web API carries them.
+  static const std::string TYPE_IMPORT;              // "import_general"
+  static const std::string TYPE_EXPORT;              // "export_general"
+  static const std::string TYPE_IMPORT_PHOTO;        // "import_photo"
+  static const std::string STRATEGY_VERSION;         // "versioning"
+  static const std::string STRATEGY_MIRROR;          // "mirror"
+  static const std::string STRATEGY_INCBKP;          // "incremental"
+  static const std::string CONFLICT_RENAME;          // "rename"
+  static const std::string CONFLICT_OVERWRITE;       // "overwrite"
+  static const std::string ROTATION_OLDEST_VERSION;  // "oldest_version"
+  static const std::string ROTATION_SMART_RECYCLE;   // "smart_recycle"
+
+  // String to number and back, exact and case-sensitive: an unknown string
+  // gives 0, an unknown number "".
+  static Registry::TASK_TYPE convertToEnumTT(const std::string& value);
+  static std::string convertToStringTT(Registry::TASK_TYPE value);
+  static Registry::COPY_STRATEGY convertToEnumCS(const std::string& value);
+  static std::string convertToStringCS(Registry::COPY_STRATEGY value);
+  static Registry::CONFLICT_POLICY convertToEnumCP(const std::string& value);
+  static std::string convertToStringCP(Registry::CONFLICT_POLICY value);
+  static Registry::ROTATION_POLICY convertToEnumRP(const std::string& value);
+  static std::string convertToStringRP(Registry::ROTATION_POLICY value);
+
+  // A JSON array of the values read as strings, in order; [] when empty.
+  static Json::Value convertToJsonArray(const std::vector<PObject>& values);
+
+  // The web interface's record of the daemon's task map: enumerations as
+  // strings, device paths shown as "/<share>..." or "[USB]...", and the
+  // next run time of the task's schedule ("N/A" without one).
+  void setJsonTask(const PObject& task, Json::Value& out);
+
+  // Request JSON to settings records. setUCSetting answers false, after a
+  // log line, for an unknown type or an empty path; for an existing task
+  // (isCreate false) the device share and the copy strategy are not
+  // stored, but the requested strategy still picks the keys read. A key of
+  // the wrong type (a string where a flag belongs) also answers false;
+  // a missing key keeps the record's default.
+  bool setUCSetting(const Json::Value& json, bool isCreate, Plovo::TaskSetting& out);
+  bool setUCTriggerTime(const Json::Value& json, Plovo::TriggerTimeSetting& out);
+  bool setUCFilter(const Json::Value& json, Plovo::FilterSetting& out);
+
  private:
   // The actions, one per method of the table.
   void List();
@@ -64,6 +116,17 @@ class PlovoHandle {
   void GetGlobalSetting();
   void SetGlobalSetting();
   void GetLogList();
+
+  // Reads "id", builds the command with build and sends it; null data on
+  // success. Delete, Run, Enable and Disable are this with their builder.
+  void SendTaskIdCmd(int (*build)(unsigned long, PObject&));
+  // Sends command and reads the reply. On failure logs "Failed to send
+  // <what> command, res=[<reply>]" and returns the web error code for the
+  // reply; 0 on success.
+  static int SendToDaemon(const PObject& command, PObject& reply, const char* what);
+  // The next trigger time of an enabled schedule; "N/A" for the id -1, an
+  // entry that cannot be loaded, or a disabled one.
+  static std::string GetNextRunTime(int64_t scheduleId);
 
   // Answer of a method whose action has not been built yet: 401, and a log
   // line naming the action.

@@ -6,6 +6,7 @@
 
 #include <string>
 
+#include "log-capture.h"
 #include "sandbox.h"
 #include "webapi/plovo.h"
 
@@ -20,6 +21,14 @@ class WebApiTest : public SandboxTest {
     VELT::APIResponse response;
     ::Process(&request, &response);
     return response;
+  }
+  // Whether a request without parameters, with no daemon listening, got
+  // past the gate to its action: the task actions refuse the missing
+  // parameters (402), "list" fails to reach the daemon, and the actions not
+  // built yet say so.
+  static bool ReachedAction(const VELT::APIResponse& response, const LogCapture& log) {
+    return response.GetErrorCode() == 402 || log.Contains("Failed to send List command") ||
+           log.Contains("is not available yet");
   }
 };
 

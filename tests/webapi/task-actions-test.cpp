@@ -1,0 +1,451 @@
+// The task methods through Process against the test daemon: the request the
+// daemon receives and the answer the web interface gets.
+#include <dlfcn.h>
+#include <json/reader.h>
+#include <syslog.h>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <velt/dev.h>
+#include <velt/sched.h>
+
+#include <atomic>
+#include <cerrno>
+#include <memory>
+#include <sstream>
+#include <thread>
+
+#include "common/utility.h"
+#include "log-capture.h"
+#include "test-daemon.h"
+#include "webapi-test-util.h"
+
+namespace {
+
+using plovo_test::DaemonAnswer;
+using plovo_test::LogCapture;
+
+Json::Value J(const std::string& text) {
+  Json::Value value;
+  std::istringstream in(text);
+  in >> value;
+  return value;
+}
+
+// JSON as the web server writes it: an unsigned and a signed 12 are alike.
+std::string Text(const Json::Value& value) { return Plovo::JsonToString(value); }
+
+PObject ErrorReply(int code) {
+  PObject reply;
+  reply["error"] = "failed";
+  reply["error_code"] = code;
+  return reply;
+}
+
+// A complete import task as the creation screen sends it.
+const char* const kNewTask = R"({"task": {"name": "Trip", "type": "import_general",
+  "source_path": "/usbshare1/DCIM", "destination_path": "/photo/album/trip",
+  "copy_strategy": "incremental", "not_keep_dir_structure": true, "conflict_policy": "overwrite",
+  "run_when_plug_in": true, "schedule_enabled": false, "schedule_content": {"hour": 3},
+  "filter": {"white_list": {"extensions": ["jpg"], "names": []},
+             "black_list": {"extensions": [], "names": ["tmp"]},
+             "customized_list": {"extensions": [], "names": []}}}})";
+
+// Service running, a USB share usbshare1 on a device without identity, and
+// a daemon on the sandbox socket.
+class TaskActionTest : public plovo_test::WebApiTest {
+ protected:
+  void SetUp() override {
+    WebApiTest::SetUp();
+    WriteStatus(4, "");
+    MakeDir("/tmp");
+    MakeDir("/usbshare1");
+    WriteFile("/dev/usb1", "");
+    WriteFile("/velt-dev/storage.json",
+              R"({"shares": [{"name": "usbshare1", "dev_path": "dev/usb1"}],
+                  "devices": [{"producer": "Acme", "product": "Stick",
+                               "partitions": [{"share_name": "usbshare1"}]}]})");
+    daemon_ = std::make_unique<plovo_test::TestDaemon>();
+  }
+  void TearDown() override {
+    daemon_.reset();
+    VeltDevClearFaults();
+    WebApiTest::TearDown();
+  }
+  // Saves a scheduler entry firing at 09:30 on Mondays; returns its id.
+  int64_t SaveSchedule(bool enabled) {
+    PVELTSCHEDTASK task = VELTSchedTaskAlloc();
+    Json::Value timetable = J(R"({"schedule": {"week_name": "1", "hour": 9, "min": 30, "repeat": 0}})");
+    int64_t id = -1;
+    EXPECT_EQ(VELTSchedTaskConvertFromJson_Schedule(timetable, task), 0);
+    EXPECT_EQ(VELTSchedCTaskSetState(task, enabled), 0);
+    EXPECT_EQ(VELTSchedTaskSave(task), 0);
+    EXPECT_EQ(VELTSchedCTaskGetID(task, &id), 0);
+    VELTSchedTaskFree(task);
+    return id;
+  }
+  std::unique_ptr<plovo_test::TestDaemon> daemon_;
+};
+
+TEST_F(TaskActionTest, ControlActionsSendOneTaskCommand) {
+  const char* const cases[][2] = {{"delete", "remove_task"}, {"run", "run_task"},
+                                  {"enable", "enable_task"}, {"disable", "disable_task"},
+                                  {"cancel", "cancel_task"}};
+  for (const auto& c : cases) {
+    VELT::APIResponse r = Call(c[0], J(R"({"id": 7})"));
+    EXPECT_TRUE(r.IsSuccess()) << c[0];
+    EXPECT_TRUE(r.GetData().isNull()) << c[0];
+    EXPECT_EQ(daemon_->LastRequest().toString(),
+              std::string("{\"action\": \"") + c[1] + "\", \"need_ack\": 1, \"task_id\": 7}");
+  }
+}
+
+// Every method that forwards maps the daemon's reason the same way; only
+// create attaches the device's share to a 403.
+TEST_F(TaskActionTest, DaemonFailuresMapToWebErrors) {
+  const struct {
+    const char* method;
+    const char* params;
+    const char* words;
+  } methods[] = {
+      {"list", "{}", "Failed to send List command, res=["},
+      {"get", R"({"id": 1})", "Failed to send GetSetting command"},
+      {"create", kNewTask, "Failed to send Create command"},
+      {"set_setting", R"({"id": 1, "task_setting": {"type": "import_photo", "source_path": "/u/a", "destination_path": "/p"}})",
+       "Failed to send SetSetting command"},
+      {"set_trigger_time", R"({"id": 1, "trigger_time": {}})", "Failed to send SetSetting command"},
+      {"set_filter", R"({"id": 1, "task_filter": {}})", "Failed to send SetFilter command"},
+      {"get_filter", R"({"id": 1})", "Failed to send GetFilter command"},
+      {"delete", R"({"id": 1})", "Failed to send task command"},
+      {"run", R"({"id": 1})", "Failed to send task command"},
+      {"cancel", R"({"id": 1})", "Failed to send task command"},
+      {"enable", R"({"id": 1})", "Failed to send task command"},
+      {"disable", R"({"id": 1})", "Failed to send task command"},
+  };
+  const int codes[][2] = {{3, 403}, {9, 410}, {10, 413}, {4, 401}, {-1, 401}};
+  for (const auto& m : methods) {
+    for (const auto& code : codes) {
+      PObject reply = code[0] < 0 ? PObject() : ErrorReply(code[0]);
+      if (code[0] < 0) reply["error"] = "failed";  // no "error_code" at all
+      daemon_->Answer(DaemonAnswer::Reply(reply));
+      LogCapture log;
+      VELT::APIResponse r = Call(m.method, J(m.params));
+      EXPECT_EQ(r.GetErrorCode(), code[1]) << m.method << " " << code[0] << "\n" << log.Dump();
+      EXPECT_TRUE(log.Contains(LOG_ERR, m.words)) << m.method << "\n" << log.Dump();
+      EXPECT_EQ(log.Contains(LOG_ERR, "no error_code!!!"), code[0] < 0);
+      const bool shareNamed = std::string(m.method) == "create" && code[1] == 403;
+      EXPECT_EQ(Text(r.GetData()), Text(shareNamed ? J(R"({"usb_share_name": "usbshare1"})") : Json::Value()))
+          << m.method;
+    }
+  }
+}
+
+TEST_F(TaskActionTest, CancelOfATaskWithNothingToStopSucceeds) {
+  daemon_->Answer(DaemonAnswer::Reply(ErrorReply(8)));
+  LogCapture log;
+  EXPECT_TRUE(Call("cancel", J(R"({"id": 3})")).IsSuccess());
+  EXPECT_FALSE(log.Contains("Failed to send task command")) << log.Dump();
+  EXPECT_EQ(Call("run", J(R"({"id": 3})")).GetErrorCode(), 401);
+}
+
+TEST_F(TaskActionTest, BadRequestsAreRefusedBeforeTheDaemonHearsOfThem) {
+  const struct {
+    const char* method;
+    const char* params;
+    int code;
+  } cases[] = {
+      {"delete", R"({"id": "seven"})", 402},
+      {"run", R"({"id": -1})", 402},
+      {"get", "{}", 402},
+      {"get_filter", R"({"id": 1.5})", 402},
+      {"set_filter", R"({"id": 1, "task_filter": []})", 402},
+      {"set_filter", R"({"id": 1, "task_filter": {"black_list": {"names": "tmp"}}})", 402},
+      {"set_trigger_time", R"({"id": 1, "trigger_time": {"run_when_plug_in": "yes"}})", 402},
+      {"set_setting", R"({"task_setting": {}})", 402},
+      {"create", R"({"task": "x"})", 402},
+      {"create", R"({"task": {"type": "export", "name": "T", "source_path": "/a", "destination_path": "/b"}})", 402},
+      {"create", R"({"task": {"type": "import_general", "source_path": "", "destination_path": "/b"}})", 402},
+      {"create", R"({"task": {"type": "import_general", "source_path": "/a", "destination_path": "/b",
+                    "copy_strategy": "versioning", "max_version_count": "many"}})", 402},
+      {"create", R"({"task": {"type": "import_general", "source_path": "/usbshare1", "destination_path": "/photo/../etc"}})", 414},
+      {"create", R"({"task": {"type": "export_general", "source_path": "/photo", "destination_path": "/usbshare1/c:"}})", 414},
+      {"set_setting", R"({"id": 1, "task_setting": {"type": "import_general", "source_path": "/u/./a", "destination_path": "/p"}})", 414},
+  };
+  for (const auto& c : cases) {
+    VELT::APIResponse r = Call(c.method, J(c.params));
+    EXPECT_EQ(r.GetErrorCode(), c.code) << c.method << " " << c.params;
+  }
+  EXPECT_EQ(daemon_->Connections(), 0);
+
+  LogCapture log;
+  Call("create", J(R"({"task": {"type": "export", "name": "T", "source_path": "/a", "destination_path": "/b"}})"));
+  EXPECT_TRUE(log.Contains(LOG_ERR, "create fail: task[T] has unknown task type[export]")) << log.Dump();
+}
+
+TEST_F(TaskActionTest, CreateSendsTheResolvedDeviceAndAnswersTheNewId) {
+  PObject ok;
+  ok["ack"] = "ok";
+  ok["task_id"] = 12;
+  daemon_->Answer(DaemonAnswer::Reply(ok));
+  VELT::APIResponse r = Call("create", J(kNewTask));
+  ASSERT_TRUE(r.IsSuccess()) << r.GetErrorCode();
+  EXPECT_EQ(Text(r.GetData()), Text(J(R"({"task_id": 12})")));
+  const PObject sent = daemon_->LastRequest();
+  EXPECT_EQ(sent["action"].asString(), "add_task");
+  EXPECT_EQ(sent["usb_share_path"].asString(), Path("/usbshare1"));
+  EXPECT_EQ(sent["usb_folder_path"].asString(), "/DCIM");
+  EXPECT_EQ(sent["nas_share_name"].asString(), "photo");
+  EXPECT_EQ(sent["nas_folder_path"].asString(), "/album/trip");
+  EXPECT_EQ(sent["producer"].asString() + "/" + sent["product"].asString(), "Acme/Stick");
+  EXPECT_EQ(sent["uuid"].asString().size(), 36u);
+  EXPECT_EQ(sent["copy_strategy"].asInt32(), Registry::COPY_STRATEGY_INCREMENTAL);
+  EXPECT_EQ(sent["keep_dir_structure"].asUInt64(), 0u);
+  EXPECT_EQ(sent["conflict_policy"].asInt32(), Registry::CONFLICT_POLICY_OVERWRITE);
+  EXPECT_EQ(sent["run_when_plug_in"].asUInt64(), 1u);
+  EXPECT_EQ(sent["schedule_json_str"].asString(), R"({"hour":3})");
+  EXPECT_EQ(sent["white_ext"].toString(), R"(["jpg"])");
+  EXPECT_EQ(sent["black_name"].toString(), R"(["tmp"])");
+
+  // A share that cannot be resolved fails in building: 411, nothing sent.
+  LogCapture log;
+  const int before = daemon_->Connections();
+  Json::Value other = J(kNewTask);
+  other["task"]["source_path"] = "/usbshare9";
+  EXPECT_EQ(Call("create", other).GetErrorCode(), 411);
+  EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to get daemon command"));
+  EXPECT_EQ(daemon_->Connections(), before);
+}
+
+// An edit names the requested strategy, but the strategy is fixed at
+// creation: only that strategy's keys are read and none is sent.
+TEST_F(TaskActionTest, SetSettingReadsOnlyTheRequestedStrategysKeys) {
+  const std::string common =
+      R"("name": "N", "type": "export_general", "source_path": "/photo", "destination_path": "/usbshare2/out",
+         "enable_rotation": true, "max_version_count": 9, "rotation_policy": "smart_recycle",
+         "conflict_policy": "overwrite", "not_keep_dir_structure": true)";
+  const struct {
+    const char* strategy;
+    const char* expected;  // the keys that depend on it
+  } cases[] = {
+      {"mirror", "conflict=1 keep=1 rotation=0/256/1"},
+      {"versioning", "conflict=1 keep=1 rotation=1/9/2"},
+      {"incremental", "conflict=2 keep=0 rotation=0/256/1"},
+  };
+  for (const auto& c : cases) {
+    VELT::APIResponse r = Call("set_setting", J(R"({"id": 4, "task_setting": {)" + common +
+                                                R"(, "copy_strategy": ")" + c.strategy + "\"}}"));
+    ASSERT_TRUE(r.IsSuccess()) << c.strategy;
+    const PObject sent = daemon_->LastRequest();
+    EXPECT_FALSE(sent.hasMember("copy_strategy"));
+    EXPECT_EQ(sent["action"].asString() + " " + sent["nas_share_name"].asString() + " " +
+                  sent["nas_folder_path"].asString() + " " + sent["usb_folder_path"].asString(),
+              "set_task_setting photo / /out");
+    std::ostringstream keys;
+    keys << "conflict=" << sent["conflict_policy"].asUInt64() << " keep=" << sent["keep_dir_structure"].asUInt64()
+         << " rotation=" << sent["enable_rotation"].asUInt64() << "/" << sent["max_version_count"].asUInt64()
+         << "/" << sent["rotation_policy"].asUInt64();
+    EXPECT_EQ(keys.str(), c.expected) << c.strategy;
+  }
+}
+
+TEST_F(TaskActionTest, FiltersGoOutAsListsAndComeBackAsTheScreensObject) {
+  ASSERT_TRUE(Call("set_filter", J(R"({"id": 2, "task_filter": {"white_list": {"names": ["a", "b"]},
+                                       "customized_list": {"extensions": ["raw"]}}})")).IsSuccess());
+  EXPECT_EQ(daemon_->LastRequest().toString(),
+            R"({"action": "set_filter_setting", "black_ext": [], "black_name": [], "custom_ext": ["raw"], )"
+            R"("custom_name": [], "need_ack": 1, "task_id": 2, "white_ext": [], "white_name": ["a", "b"]})");
+
+  PObject reply;
+  reply["ack"] = "ok";
+  reply["white_ext"].asArray().push_back(PObject("jpg"));
+  reply["black_name"].asArray().push_back(PObject("tmp"));
+  reply["black_name"].asArray().push_back(PObject(uint64_t{7}));
+  daemon_->Answer(DaemonAnswer::Reply(reply));
+  VELT::APIResponse r = Call("get_filter", J(R"({"id": 2})"));
+  ASSERT_TRUE(r.IsSuccess());
+  EXPECT_EQ(Text(r.GetData()), Text(J(R"({"task_filter": {
+      "white_list": {"extensions": ["jpg"], "names": []},
+      "black_list": {"extensions": [], "names": ["tmp", "7"]},
+      "customized_list": {"extensions": [], "names": []}}})")));
+}
+
+PObject TaskMap(uint64_t type, bool mounted, bool isDefault, const char* source, const char* destination) {
+  PObject task;
+  task["id"] = uint64_t{5};
+  task["type"] = type;
+  task["uuid"] = isDefault ? "PLOVO_DEFAULT_SD_UUID" : "2b1e";
+  task["is_default_task"] = isDefault;
+  task["is_usb_mounted"] = mounted;
+  task["usb_share_name"] = "usbshare1";
+  task["source_path"] = source;
+  task["destination_path"] = destination;
+  task["schedule_id"] = static_cast<uint64_t>(-1);
+  return task;
+}
+
+TEST_F(TaskActionTest, ListShowsDevicePathsTheWayTheScreenDoes) {
+  PObject reply;
+  reply["ack"] = "ok";
+  auto& list = reply["task_list"].asArray();
+  list.push_back(TaskMap(1, true, false, "/DCIM", "/photo/trip"));
+  list.push_back(TaskMap(3, false, true, "/", "/"));
+  list.push_back(TaskMap(2, false, false, "/photo", "/backup"));
+  list.push_back(TaskMap(1, true, false, "/", "/"));
+  list.push_back(TaskMap(9, true, false, "/a", "/b"));
+  daemon_->Answer(DaemonAnswer::Reply(reply));
+  VELT::APIResponse r = Call("list");
+  ASSERT_TRUE(r.IsSuccess());
+  EXPECT_EQ(daemon_->LastRequest().toString(), R"({"action": "list_task", "need_ack": 1})");
+  const Json::Value& tasks = r.GetData()["tasks"];
+  ASSERT_EQ(tasks.size(), 5u);
+  const char* const shown[][4] = {{"import_general", "/usbshare1/DCIM", "/photo/trip", "NA"},
+                                  {"import_photo", "[USB]", "", "SD_CARD"},
+                                  {"export_general", "/photo", "[USB]/backup", "NA"},
+                                  {"import_general", "/usbshare1", "/", "NA"}};
+  for (int i = 0; i < 4; ++i) {
+    EXPECT_EQ(tasks[i]["type"].asString(), shown[i][0]);
+    EXPECT_EQ(tasks[i]["source_path"].asString(), shown[i][1]) << i;
+    EXPECT_EQ(tasks[i]["destination_path"].asString(), shown[i][2]) << i;
+    EXPECT_EQ(tasks[i]["default_device_port"].asString(), shown[i][3]) << i;
+  }
+  EXPECT_EQ(tasks[4]["type"].asString(), "");
+  EXPECT_FALSE(tasks[4].isMember("source_path") || tasks[4].isMember("destination_path"));
+
+  daemon_->Answer(DaemonAnswer::Ok());
+  EXPECT_EQ(Text(Call("list").GetData()), R"({"tasks":[]})");
+}
+
+TEST_F(TaskActionTest, GetAnswersTheWholeRecord) {
+  PObject task = TaskMap(3, true, true, "/DCIM", "/photo");
+  task["ack"] = "ok";
+  task["uuid"] = "PLOVO_DEFAULT_USB_UUID";
+  task["task_name"] = "Camera";
+  task["task_status"] = "running";
+  task["copy_file_path"] = "/DCIM/1.jpg";
+  task["is_nas_mounted"] = true;
+  task["latest_finish_time"] = uint64_t{1700000000};
+  task["error_code"] = static_cast<uint64_t>(-2);
+  task["eject_when_task_done"] = true;
+  task["copy_strategy"] = 3;
+  task["keep_dir_structure"] = true;
+  task["rename_photo_video"] = true;
+  task["conflict_policy"] = 2;
+  task["max_version_count"] = uint64_t{1} << 40;
+  task["rotation_policy"] = 3;
+  daemon_->Answer(DaemonAnswer::Reply(task));
+  VELT::APIResponse r = Call("get", J(R"({"id": 5})"));
+  ASSERT_TRUE(r.IsSuccess());
+  EXPECT_EQ(daemon_->LastRequest().toString(), R"({"action": "get_task_setting", "need_ack": 1, "task_id": 5})");
+  EXPECT_EQ(Text(r.GetData()), Text(J(R"({"task": {"id": 5, "is_default_task": true, "default_device_port": "USB",
+      "type": "import_photo", "name": "Camera", "status": "running", "copy_file_path": "/DCIM/1.jpg",
+      "is_usb_mounted": true, "is_nas_mounted": true, "is_task_runnable": false,
+      "latest_finish_time": 1700000000, "error_code": -2, "source_path": "/usbshare1/DCIM",
+      "destination_path": "/photo", "run_when_plug_in": false, "eject_when_task_done": true,
+      "copy_strategy": "incremental", "not_keep_dir_structure": false, "smart_create_date_dir": false,
+      "rename_photo_video": true, "remove_src_file": false, "conflict_policy": "overwrite",
+      "enable_rotation": false, "max_version_count": 1099511627776, "rotation_policy": "",
+      "schedule_id": -1, "next_run_time": "N/A"}})")));
+}
+
+TEST_F(TaskActionTest, NextRunTimeComesFromAnEnabledSchedule) {
+  WriteFile("/velt-dev/sched-now", "2026/11/21 10:00");  // a Saturday
+  const int64_t enabled = SaveSchedule(true);
+  const int64_t disabled = SaveSchedule(false);
+  const int64_t cases[][2] = {{enabled, 1}, {disabled, 0}, {disabled + 50, 0}};
+  for (const auto& c : cases) {
+    PObject reply;
+    reply["ack"] = "ok";
+    reply["schedule_id"] = static_cast<uint64_t>(c[0]);
+    daemon_->Answer(DaemonAnswer::Reply(reply));
+    LogCapture log;
+    VELT::APIResponse r = Call("set_trigger_time", J(R"({"id": 1, "trigger_time": {"schedule_enabled": true}})"));
+    ASSERT_TRUE(r.IsSuccess());
+    Json::Value expected(Json::objectValue);
+    expected["schedule_id"] = Json::Int64(c[0]);
+    expected["next_run_time"] = c[1] ? "2026/11/23 09:30" : "N/A";
+    EXPECT_EQ(Text(r.GetData()), Text(expected));
+    EXPECT_EQ(log.Contains(LOG_ERR, "VELTSchedTaskLoad() failed."), c[0] == disabled + 50) << log.Dump();
+  }
+  // No schedule: the scheduler is not asked at all.
+  VeltDevFailCall("VELTSchedTaskAlloc", 1, 0, VLIBC_ERR_NO_MEMORY);
+  PObject task = TaskMap(1, true, false, "/", "/p");
+  task["ack"] = "ok";
+  daemon_->Answer(DaemonAnswer::Reply(task));
+  LogCapture log;
+  EXPECT_EQ(Call("get", J(R"({"id": 5})")).GetData()["task"]["next_run_time"].asString(), "N/A");
+  EXPECT_FALSE(log.Contains("VELTSchedTask")) << log.Dump();
+}
+
+// The server may have given up root for good: create then leaves the
+// request unanswered so that the server's own answer stands. setresuid is
+// taken over in this program to refuse the raise of the action (the third
+// call in the request: the gate raises and restores first).
+std::atomic<int> gSetresuidLeft{-1};
+
+TEST_F(TaskActionTest, CreateWithoutRootLeavesTheRequestUnanswered) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to set up the ids";
+  daemon_.reset();
+  pid_t child = fork();
+  if (child == 0) {
+    if (setresuid(0, 65534, 0) != 0) _exit(10);
+    gSetresuidLeft = 2;
+    LogCapture log;
+    VELT::APIResponse r = Call("create", J(kNewTask));
+    if (r.AnswerCount() != 0) _exit(11);
+    if (!log.Contains(LOG_ERR, "Failed to run as root")) _exit(12);
+    if (log.Contains("Failed to get daemon command")) _exit(13);
+    _exit(0);
+  }
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+}
+
+// Eight server threads at once, every task method.
+TEST_F(TaskActionTest, ConcurrentRequestsAreEachAnsweredRight) {
+  PObject reply = TaskMap(1, true, false, "/DCIM", "/p");
+  reply["ack"] = "ok";
+  reply["task_id"] = 12;
+  reply["task_list"].asArray().push_back(TaskMap(2, true, false, "/p", "/o"));
+  reply["white_name"].asArray().push_back(PObject("x"));
+  daemon_->Answer(DaemonAnswer::Reply(reply));
+  const struct {
+    const char* method;
+    const char* params;
+    const char* check;  // a member of the answer's data, or "" for null data
+  } calls[] = {{"list", "{}", "tasks"}, {"get", R"({"id": 5})", "task"}, {"create", kNewTask, "task_id"},
+               {"get_filter", R"({"id": 5})", "task_filter"}, {"run", R"({"id": 5})", ""},
+               {"set_trigger_time", R"({"id": 5, "trigger_time": {}})", "next_run_time"},
+               {"cancel", R"({"id": 5})", ""}, {"set_filter", R"({"id": 5, "task_filter": {}})", ""}};
+  std::atomic<int> wrong{0};
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 8; ++t) {
+    threads.emplace_back([&, t] {
+      for (int i = 0; i < 12; ++i) {
+        const auto& c = calls[(t + i) % 8];
+        VELT::APIResponse r = Call(c.method, J(c.params));
+        const bool right = r.AnswerCount() == 1 && r.IsSuccess() &&
+                           (*c.check ? r.GetData().isMember(c.check) : r.GetData().isNull());
+        if (!right) ++wrong;
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  EXPECT_EQ(wrong.load(), 0);
+  EXPECT_EQ(daemon_->Requests().size(), 96u);
+}
+
+}  // namespace
+
+// Passes every call through to the C library until gSetresuidLeft calls
+// have been made, then refuses them.
+extern "C" int setresuid(uid_t ruid, uid_t euid, uid_t suid) {
+  using Fn = int (*)(uid_t, uid_t, uid_t);
+  static const Fn real = reinterpret_cast<Fn>(dlsym(RTLD_NEXT, "setresuid"));
+  if (gSetresuidLeft.load() == 0) {
+    errno = EPERM;
+    return -1;
+  }
+  if (gSetresuidLeft.load() > 0) --gSetresuidLeft;
+  return real(ruid, euid, suid);
+}

@@ -1,0 +1,60 @@
+// "delete", "run", "enable", "disable" and "cancel": one daemon command on
+// one task. Whether the task exists is the daemon's answer.
+#include "common/log.h"
+#include "ipc/daemon-ipc.h"
+#include "ipc/plovo-command.h"
+#include "webapi/plovo.h"
+
+namespace {
+
+// The daemon's "error_code" for a task that has nothing to stop.
+constexpr int32_t kNothingToCancel = 8;
+
+}  // namespace
+
+void PlovoHandle::SendTaskIdCmd(int (*build)(unsigned long, PObject&)) {
+  const auto id = request->GetAndCheckIntegral<uint64_t>("id", VELT::PARAM_REQUIRED, nullptr);
+  if (id.IsInvalid()) {
+    response->SetError(402);
+    return;
+  }
+  PObject command, reply;
+  if (build(id.Get(), command) != 0) {
+    PLOVO_LOG(LOG_ERR, "Failed to get daemon command");
+    response->SetError(401);
+    return;
+  }
+  if (int code = SendToDaemon(command, reply, "task")) {
+    response->SetError(code);
+    return;
+  }
+  response->SetSuccess();
+}
+
+void PlovoHandle::Delete() { SendTaskIdCmd(Plovo::DeleteTaskCmd); }
+void PlovoHandle::Run() { SendTaskIdCmd(Plovo::StartTaskCmd); }
+void PlovoHandle::Enable() { SendTaskIdCmd(Plovo::EnableTaskCmd); }
+void PlovoHandle::Disable() { SendTaskIdCmd(Plovo::DisableTaskCmd); }
+
+void PlovoHandle::Cancel() {
+  const auto id = request->GetAndCheckIntegral<uint64_t>("id", VELT::PARAM_REQUIRED, nullptr);
+  if (id.IsInvalid()) {
+    response->SetError(402);
+    return;
+  }
+  PObject command, reply;
+  if (Plovo::StopTaskCmd(id.Get(), command) != 0) {
+    PLOVO_LOG(LOG_ERR, "Failed to get daemon command");
+    response->SetError(401);
+    return;
+  }
+  DaemonIPC daemon;
+  // Cancelling a task that is not running leaves it as the user wants it.
+  if (daemon.SendCommand(command, reply) < 0 &&
+      !(reply.hasMember("error_code") && reply["error_code"].asInt32() == kNothingToCancel)) {
+    PLOVO_LOG(LOG_ERR, "Failed to send task command, res=[%s]", reply.toString().c_str());
+    response->SetError(GetErrorCodeFromResponse(reply));
+    return;
+  }
+  response->SetSuccess();
+}
