@@ -1,6 +1,6 @@
 // plovo-api: the command-line host of the web-API module.
 //
-//   plovo-api [--module PATH] METHOD [PARAMS_JSON]
+//   plovo-api [--debug] [--module PATH] METHOD [PARAMS_JSON]
 //
 // Loads the module the way the web server does (dlopen, GetAPITable, then
 // Process for one request) and prints the answer as one line of JSON:
@@ -8,7 +8,8 @@
 //   {"success":false,"error":{"code":N,"data":...}}
 // A request the module leaves unanswered prints error code 100. Exit status:
 // 0 success, 1 an error answer, 2 a usage or loading error. The module's
-// log lines go to syslog and, for whoever runs this by hand, to stderr.
+// log lines go to syslog and, for whoever runs this by hand, to stderr; as
+// on a server, debug lines are left out unless --debug is given.
 #include <dlfcn.h>
 #include <json/json.h>
 #include <syslog.h>
@@ -28,7 +29,7 @@ constexpr int kUnanswered = 100;
 
 int Usage(const std::string& why) {
   std::cerr << "plovo-api: " << why << "\n"
-            << "usage: plovo-api [--module PATH] METHOD [PARAMS_JSON]\n";
+            << "usage: plovo-api [--debug] [--module PATH] METHOD [PARAMS_JSON]\n";
   return 2;
 }
 
@@ -53,6 +54,11 @@ std::string Compact(const Json::Value& value) {
 int main(int argc, char** argv) {
   std::string modulePath = DefaultModulePath();
   int arg = 1;
+  bool debug = false;
+  if (arg < argc && std::strcmp(argv[arg], "--debug") == 0) {
+    debug = true;
+    ++arg;
+  }
   if (arg < argc && std::strcmp(argv[arg], "--module") == 0) {
     if (arg + 1 >= argc) return Usage("--module needs a path");
     modulePath = argv[arg + 1];
@@ -73,6 +79,7 @@ int main(int argc, char** argv) {
   if (arg < argc) return Usage("too many arguments");
 
   openlog("plovo-api", LOG_PERROR, LOG_USER);
+  setlogmask(LOG_UPTO(debug ? LOG_DEBUG : LOG_INFO));
   void* module = dlopen(modulePath.c_str(), RTLD_NOW | RTLD_LOCAL);
   if (module == nullptr) {
     std::cerr << "plovo-api: cannot load module: " << dlerror() << "\n";
