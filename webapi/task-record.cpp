@@ -170,10 +170,12 @@ void PlovoHandle::setJsonTask(const PObject& task, Json::Value& out) {
   out["next_run_time"] = GetNextRunTime(scheduleId);
 }
 
-int PlovoHandle::SendToDaemon(const PObject& command, PObject& reply, const char* what) {
+int PlovoHandle::SendToDaemon(const PObject& command, PObject& reply, const char* what,
+                              const char* file, int line) {
   DaemonIPC daemon;
   if (daemon.SendCommand(command, reply) >= 0) return 0;
-  PLOVO_LOG(LOG_ERR, "Failed to send %s command, res=[%s]", what, reply.toString().c_str());
+  Plovo::LogWrite(LOG_ERR, "%s:%d Failed to send %s command, res=[%s]", Plovo::LogBaseName(file),
+                  line, what, reply.toString().c_str());
   return GetErrorCodeFromResponse(reply);
 }
 

@@ -92,9 +92,10 @@ class PlovoHandle {
   // Request JSON to settings records. setUCSetting answers false, after a
   // log line, for an unknown type or an empty path; for an existing task
   // (isCreate false) the device share and the copy strategy are not
-  // stored, but the requested strategy still picks the keys read. A key of
-  // the wrong type (a string where a flag belongs) also answers false;
-  // a missing key keeps the record's default.
+  // stored, but the requested strategy still picks the keys read; keys it
+  // does not read keep the record's defaults. A key that is read but
+  // missing counts as JSON's default (false, 0, ""); one of the wrong type
+  // (a string where a flag belongs) answers false.
   bool setUCSetting(const Json::Value& json, bool isCreate, Plovo::TaskSetting& out);
   bool setUCTriggerTime(const Json::Value& json, Plovo::TriggerTimeSetting& out);
   bool setUCFilter(const Json::Value& json, Plovo::FilterSetting& out);
@@ -121,9 +122,10 @@ class PlovoHandle {
   // success. Delete, Run, Enable and Disable are this with their builder.
   void SendTaskIdCmd(int (*build)(unsigned long, PObject&));
   // Sends command and reads the reply. On failure logs "Failed to send
-  // <what> command, res=[<reply>]" and returns the web error code for the
-  // reply; 0 on success.
-  static int SendToDaemon(const PObject& command, PObject& reply, const char* what);
+  // <what> command, res=[<reply>]" under the calling action's file and
+  // line, and returns the web error code for the reply; 0 on success.
+  static int SendToDaemon(const PObject& command, PObject& reply, const char* what,
+                          const char* file = __builtin_FILE(), int line = __builtin_LINE());
   // The next trigger time of an enabled schedule; "N/A" for the id -1, an
   // entry that cannot be loaded, or a disabled one.
   static std::string GetNextRunTime(int64_t scheduleId);
