@@ -1,0 +1,119 @@
+// The daemon's side of a command exchange, for the benchmarks that send
+// commands: server threads on the sandbox's daemon socket, and the raw
+// client round trip they are measured against.
+//
+// Two servers answer one command per connection. RawServer is nothing but
+// system calls (accept, receive the expected bytes, send the answer's
+// bytes, close); ListenerServer is the daemon's side as the library's own
+// endpoints make it (IPCListener, IPCSender, a decoded request and an
+// encoded answer). Each checks what it received, so that a benchmark
+// measuring a wrong request fails instead of reporting a figure.
+#ifndef PLOVO_BENCH_BENCH_DAEMON_H
+#define PLOVO_BENCH_BENCH_DAEMON_H
+
+#include <atomic>
+#include <cstddef>
+#include <string>
+#include <thread>
+
+#include "ipc/pobject.h"
+#include "ipc/simple-ipc.h"
+
+namespace plovo_bench {
+
+// The bytes of a string literal, embedded zero bytes included, for the
+// wire form of a message written out by hand.
+template <size_t N>
+std::string WireBytes(const char (&literal)[N]) {
+  return std::string(literal, N - 1);
+}
+
+// A connected stream socket to the Unix domain socket at path; -1 on
+// failure.
+int ConnectTo(const std::string& path);
+
+// Receives exactly n bytes from a blocking socket; false when the peer
+// closes first or on an error.
+bool RecvAll(int fd, char* data, size_t n);
+
+// The largest request or answer the raw loop moves; the bytes sit on the
+// stack, as a raw client's would.
+constexpr size_t kRawMessageLimit = 256;
+
+// One raw client exchange: connect to path, send request, receive
+// reply.size() bytes, compare them with reply, close. False on any failure
+// or a different answer.
+bool RawRoundTrip(const std::string& path, const std::string& request, const std::string& reply);
+
+// Whether two values are of the same kinds with the same contents, maps
+// key by key and arrays element by element.
+bool SameValue(const PObject& a, const PObject& b);
+
+// A server thread on the daemon socket. Serve handles one accepted
+// connection and closes it. Stop wakes the blocked accept with a
+// connection of its own; derived classes call it in their destructors,
+// before their own members go.
+class Server {
+ public:
+  Server() = default;
+  virtual ~Server() = default;
+  Server(const Server&) = delete;
+  Server& operator=(const Server&) = delete;
+
+  void Stop();
+
+ protected:
+  // Starts the thread; path_ must already be set.
+  void Run();
+  // The descriptor of the next connection, negative on failure.
+  virtual int Accept() = 0;
+  virtual void Serve(int fd) = 0;
+
+  std::string path_;
+
+ private:
+  std::atomic<bool> stop_{false};
+  std::thread thread_;
+};
+
+// Answers the bytes reply to a connection that sends exactly the bytes
+// request; a wrong request gets no answer, which fails the client.
+class RawServer : public Server {
+ public:
+  RawServer(std::string request, std::string reply);
+  ~RawServer() override;
+  // Binds and listens on the daemon socket and starts the thread.
+  bool Start();
+
+ private:
+  int Accept() override;
+  void Serve(int fd) override;
+
+  std::string request_;
+  std::string reply_;
+  int fd_ = -1;
+};
+
+// Answers reply to a request equal to expected (SameValue), and
+// {"error": "unexpected request"} to any other, which makes
+// DaemonIPC::SendCommand fail.
+class ListenerServer : public Server {
+ public:
+  ListenerServer(PObject expected, PObject reply);
+  ~ListenerServer() override;
+  // Prepares the listener on the daemon socket and starts the thread.
+  bool Start();
+
+ private:
+  int Accept() override;
+  void Serve(int fd) override;
+
+  PObject expected_;
+  PObject reply_;
+  PObject refusal_;
+  IPCListener listener_;
+};
+
+}  // namespace plovo_bench
+
+#endif
