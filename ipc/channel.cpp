@@ -20,6 +20,7 @@
 #include <climits>
 #include <cstring>
 #include <mutex>
+#include <new>
 
 #include "common/log.h"
 #include "ipc/error-code.h"
@@ -207,12 +208,18 @@ class BufferCache {
   void Give(char* buffer, unsigned long capacity) {
     {
       std::lock_guard<std::mutex> lock(mutex_);
-      if (count_ < kKeep) {
+      if (!drained_ && count_ < kKeep) {
         kept_[count_++] = {buffer, capacity};
         return;
       }
     }
     delete[] buffer;
+  }
+  // Frees what is kept, and keeps nothing from now on.
+  void Drain() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    drained_ = true;
+    while (count_ > 0) delete[] kept_[--count_].buffer;
   }
 
  private:
@@ -224,14 +231,22 @@ class BufferCache {
   std::mutex mutex_;
   Kept kept_[kKeep] = {};
   size_t count_ = 0;
+  bool drained_ = false;
 };
 
-// Never destroyed, so that a channel released during static destruction
-// still finds it; what it keeps stays reachable.
+// In static storage and never destroyed, so that a channel released during
+// static destruction still finds it.
 BufferCache& Buffers() {
-  static BufferCache* cache = new BufferCache;
+  alignas(BufferCache) static unsigned char storage[sizeof(BufferCache)];
+  static BufferCache* cache = new (storage) BufferCache;
   return *cache;
 }
+
+// The kept buffers are freed when the program ends or the module that holds
+// this code is unloaded: after an unload nothing could reach them again.
+struct BufferDrain {
+  ~BufferDrain() { Buffers().Drain(); }
+} gBufferDrain;
 
 }  // namespace
 
