@@ -19,15 +19,7 @@ void PlovoHandle::SendTaskIdCmd(int (*build)(unsigned long, PObject&)) {
     return;
   }
   PObject command, reply;
-  if (build(id.Get(), command) != 0) {
-    PLOVO_LOG(LOG_ERR, "Failed to get daemon command");
-    response->SetError(401);
-    return;
-  }
-  if (int code = SendToDaemon(command, reply, "task")) {
-    response->SetError(code);
-    return;
-  }
+  if (!Forward(build(id.Get(), command), command, reply, "task")) return;
   response->SetSuccess();
 }
 

@@ -179,19 +179,25 @@ int PlovoHandle::SendToDaemon(const PObject& command, PObject& reply, const char
   return GetErrorCodeFromResponse(reply);
 }
 
+bool PlovoHandle::Forward(int built, const PObject& command, PObject& reply, const char* what,
+                          const char* file, int line) {
+  if (built != 0) {
+    Plovo::LogWrite(LOG_ERR, "%s:%d Failed to get daemon command", Plovo::LogBaseName(file), line);
+    response->SetError(401);
+    return false;
+  }
+  if (int code = SendToDaemon(command, reply, what, file, line)) {
+    response->SetError(code);
+    return false;
+  }
+  return true;
+}
+
 void PlovoHandle::List() {
   Json::Value data(Json::objectValue);
   data["tasks"] = Json::Value(Json::arrayValue);
   PObject command, reply;
-  if (Plovo::ListTaskCmd(command) != 0) {
-    PLOVO_LOG(LOG_ERR, "Failed to get daemon command");
-    response->SetError(401);
-    return;
-  }
-  if (int code = SendToDaemon(command, reply, "List")) {
-    response->SetError(code);
-    return;
-  }
+  if (!Forward(Plovo::ListTaskCmd(command), command, reply, "List")) return;
   Json::Value& tasks = data["tasks"];
   for (const PObject& task : reply["task_list"].asArray()) {
     Json::Value record(Json::objectValue);
@@ -208,15 +214,7 @@ void PlovoHandle::Get() {
     return;
   }
   PObject command, reply;
-  if (Plovo::GetTaskSettingCmd(id.Get(), command) != 0) {
-    PLOVO_LOG(LOG_ERR, "Failed to get daemon command");
-    response->SetError(401);
-    return;
-  }
-  if (int code = SendToDaemon(command, reply, "GetSetting")) {
-    response->SetError(code);
-    return;
-  }
+  if (!Forward(Plovo::GetTaskSettingCmd(id.Get(), command), command, reply, "GetSetting")) return;
   Json::Value data(Json::objectValue);
   setJsonTask(reply, data["task"]);
   response->SetSuccess(data);

@@ -218,13 +218,8 @@ void PlovoHandle::SetSetting() {
     return;
   }
   PObject command, reply;
-  if (Plovo::SetTaskSettingCmd(id.Get(), setting, command) != 0) {
-    PLOVO_LOG(LOG_ERR, "Failed to get daemon command");
-    response->SetError(401);
-    return;
-  }
-  if (int code = SendToDaemon(command, reply, "SetSetting")) {
-    response->SetError(code);
+  if (!Forward(Plovo::SetTaskSettingCmd(id.Get(), setting, command), command, reply,
+               "SetSetting")) {
     return;
   }
   response->SetSuccess();
@@ -239,14 +234,9 @@ void PlovoHandle::SetTriggerTime() {
     return;
   }
   PObject command, reply;
-  if (Plovo::SetTriggerTimeSettingCmd(id.Get(), trigger, command) != 0) {
-    PLOVO_LOG(LOG_ERR, "Failed to get daemon command");
-    response->SetError(401);
-    return;
-  }
   // The same words as set_setting's failure: log readers search for them.
-  if (int code = SendToDaemon(command, reply, "SetSetting")) {
-    response->SetError(code);
+  if (!Forward(Plovo::SetTriggerTimeSettingCmd(id.Get(), trigger, command), command, reply,
+               "SetSetting")) {
     return;
   }
   const int64_t scheduleId = reply["schedule_id"].asInt64();
@@ -265,13 +255,8 @@ void PlovoHandle::SetFilter() {
     return;
   }
   PObject command, reply;
-  if (Plovo::SetFilterSettingCmd(id.Get(), filter, command) != 0) {
-    PLOVO_LOG(LOG_ERR, "Failed to get daemon command");
-    response->SetError(401);
-    return;
-  }
-  if (int code = SendToDaemon(command, reply, "SetFilter")) {
-    response->SetError(code);
+  if (!Forward(Plovo::SetFilterSettingCmd(id.Get(), filter, command), command, reply,
+               "SetFilter")) {
     return;
   }
   response->SetSuccess();
@@ -284,15 +269,7 @@ void PlovoHandle::GetFilter() {
     return;
   }
   PObject command, reply;
-  if (Plovo::GetFilterSettingCmd(id.Get(), command) != 0) {
-    PLOVO_LOG(LOG_ERR, "Failed to get daemon command");
-    response->SetError(401);
-    return;
-  }
-  if (int code = SendToDaemon(command, reply, "GetFilter")) {
-    response->SetError(code);
-    return;
-  }
+  if (!Forward(Plovo::GetFilterSettingCmd(id.Get(), command), command, reply, "GetFilter")) return;
   Json::Value filter(Json::objectValue);
   filter["white_list"]["extensions"] = convertToJsonArray(reply["white_ext"].asArray());
   filter["white_list"]["names"] = convertToJsonArray(reply["white_name"].asArray());

@@ -126,6 +126,12 @@ class PlovoHandle {
   // line, and returns the web error code for the reply; 0 on success.
   static int SendToDaemon(const PObject& command, PObject& reply, const char* what,
                           const char* file = __builtin_FILE(), int line = __builtin_LINE());
+  // The common road of a forwarding action: built is the builder's result.
+  // A failed build answers 401 ("Failed to get daemon command"), a failed
+  // exchange the reply's code; both are logged under the caller's line.
+  // True when the reply is there to be read.
+  bool Forward(int built, const PObject& command, PObject& reply, const char* what,
+               const char* file = __builtin_FILE(), int line = __builtin_LINE());
   // The next trigger time of an enabled schedule; "N/A" for the id -1, an
   // entry that cannot be loaded, or a disabled one.
   static std::string GetNextRunTime(int64_t scheduleId);

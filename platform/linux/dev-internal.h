@@ -32,6 +32,13 @@ bool FaultHit(const char* call, const char* file, int line);
 // Returns 0 or the errno of the failing step.
 int ReadWholeFile(const std::string& path, std::string* out, struct stat* st);
 
+// Replaces file by data through a temporary file in the same folder, so
+// that a reader sees the old or the new content, never a part. old is the
+// stat of the file being replaced (its mode and owner are kept), null for a
+// new file (0644). On failure sets the last error (VLIBC_ERR_NOT_FOUND when
+// the folder is missing, else VLIBC_ERR_IO) and returns false.
+bool ReplaceFile(const std::string& file, const std::string& data, const struct stat* old);
+
 // Reads the JSON document of the state file StateDir() + "/" + name, in
 // strict mode. Returns 1 when read, 0 when the file is missing, and -1 when
 // it cannot be read or is not valid JSON.

@@ -131,33 +131,6 @@ bool EntryIds(std::vector<int64_t>* ids) {
 
 bool MakeDir(const std::string& path) { return mkdir(path.c_str(), 0755) == 0 || errno == EEXIST; }
 
-bool WriteAll(int fd, const std::string& data) {
-  size_t done = 0;
-  while (done < data.size()) {
-    ssize_t n = write(fd, data.data() + done, data.size() - done);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return false;
-    }
-    done += static_cast<size_t>(n);
-  }
-  return true;
-}
-
-// Replaces path by data through a temporary file in the same folder, so that
-// a reader, listing included, sees the old or the new entry and never a part
-// of one. The temporary name starts with '.', which no entry name does.
-bool WriteAtomically(const std::string& dir, const std::string& base, const std::string& data) {
-  std::string tmp = dir + "/." + base + ".XXXXXX";
-  int fd = mkostemp(&tmp[0], O_CLOEXEC);
-  if (fd < 0) return false;
-  bool ok = fchmod(fd, 0644) == 0 && WriteAll(fd, data);
-  ok = (close(fd) == 0) && ok;
-  ok = ok && rename(tmp.c_str(), (dir + "/" + base).c_str()) == 0;
-  if (!ok) unlink(tmp.c_str());
-  return ok;
-}
-
 // An exclusive flock on the folder's ".lock", held while the object lives.
 // It serialises the writers, so that two new entries never get one id and a
 // save never brings back an entry removed under it. Readers take no lock:
@@ -213,7 +186,7 @@ bool AllocateId(int64_t* id) {
   // next-id is written before the entry: if the entry then fails, its id is
   // skipped, which is harmless, and never given twice.
   if (next == INT64_MAX ||
-      !WriteAtomically(SchedDir(), "next-id", std::to_string(next + 1) + "\n")) {
+      !velt_dev::ReplaceFile(SchedDir() + "/next-id", std::to_string(next + 1) + "\n", nullptr)) {
     VELT_FAIL(VLIBC_ERR_IO);
     return false;
   }
@@ -374,7 +347,7 @@ int SaveEntry(VELTSCHEDTASK* task) {
   Json::StreamWriterBuilder writer;
   writer["indentation"] = "  ";
   std::string text = Json::writeString(writer, EntryToJson(*task, id)) + "\n";
-  if (!WriteAtomically(SchedDir(), std::to_string(id) + ".json", text)) {
+  if (!velt_dev::ReplaceFile(SchedDir() + "/" + std::to_string(id) + ".json", text, nullptr)) {
     VELT_FAIL(VLIBC_ERR_IO);
     return -1;
   }

@@ -91,49 +91,6 @@ bool ReadKeyFile(const char* file, std::string* content, struct stat* st) {
   return false;
 }
 
-bool WriteAll(int fd, const std::string& data) {
-  size_t done = 0;
-  while (done < data.size()) {
-    ssize_t n = write(fd, data.data() + done, data.size() - done);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return false;
-    }
-    done += static_cast<size_t>(n);
-  }
-  return true;
-}
-
-// Replaces file by data through a temporary file in the same folder, so that
-// a reader sees the old or the new content, never a part. old is the stat of
-// the file being replaced, null for a new file. No fsync: on a development
-// host only readers running at the same time matter, not power loss.
-bool ReplaceFile(const std::string& file, const std::string& data, const struct stat* old) {
-  size_t slash = file.rfind('/');
-  std::string dir = slash == std::string::npos ? "." : file.substr(0, slash);
-  std::string base = slash == std::string::npos ? file : file.substr(slash + 1);
-  std::string tmp = dir + "/." + base + ".XXXXXX";
-  int fd = mkostemp(&tmp[0], O_CLOEXEC);
-  if (fd < 0) {
-    VELT_FAIL(errno == ENOENT ? VLIBC_ERR_NOT_FOUND : VLIBC_ERR_IO);
-    return false;
-  }
-  bool ok = fchmod(fd, old ? (old->st_mode & 07777) : 0644) == 0;
-  if (ok && old && (old->st_uid != geteuid() || old->st_gid != getegid())) {
-    if (fchown(fd, old->st_uid, old->st_gid) != 0) {
-      // Only root may give a file away; anyone else leaves it their own.
-    }
-  }
-  ok = ok && WriteAll(fd, data);
-  ok = (close(fd) == 0) && ok;
-  ok = ok && rename(tmp.c_str(), file.c_str()) == 0;
-  if (!ok) {
-    VELT_FAIL(VLIBC_ERR_IO);
-    unlink(tmp.c_str());
-  }
-  return ok;
-}
-
 // One key/value line in the caller's format, ending with a newline so that
 // it never joins the next line.
 bool FormatEntry(const char* format, const char* key, const char* value, std::string* entry) {
@@ -236,7 +193,7 @@ int VLIBCFileSetKeyValue(const char* file, const char* key, const char* value, c
     if (!out.empty() && out.back() != '\n') out += '\n';
     out += entry;
   }
-  return ReplaceFile(file, out, exists ? &st : nullptr) ? 0 : -1;
+  return velt_dev::ReplaceFile(file, out, exists ? &st : nullptr) ? 0 : -1;
 }
 
 int VLIBCFileCheckKeyValue(const char* file, const char* key, const char* value, int /*flags*/) {
@@ -263,7 +220,7 @@ int VLIBCFileRemoveKey(const char* file, const char* key) {
   bool matched;
   std::string out = RewriteLines(content, key, nullptr, &matched);
   if (!matched) return 0;
-  return ReplaceFile(file, out, &st) ? 0 : -1;
+  return velt_dev::ReplaceFile(file, out, &st) ? 0 : -1;
 }
 
 int VLIBCFileExist(const char* path) {
