@@ -177,4 +177,13 @@ void RunBenchmarks(int argc, char** argv, SummaryReporter& reporter) {
 
 const char* Verdict(bool met) { return met ? "met" : "MISSED"; }
 
+benchmark::internal::Benchmark* RegisterRepeated(const char* name, void (*fn)(benchmark::State&),
+                                                 int repetitions, benchmark::TimeUnit unit) {
+  return benchmark::RegisterBenchmark(name, fn)
+      ->Repetitions(repetitions)
+      ->ReportAggregatesOnly(true)
+      ->UseRealTime()
+      ->Unit(unit);
+}
+
 }  // namespace plovo_bench

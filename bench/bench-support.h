@@ -85,6 +85,12 @@ class SummaryReporter : public benchmark::ConsoleReporter {
 
 void RunBenchmarks(int argc, char** argv, SummaryReporter& reporter);
 
+// Registers fn under name, timed by the wall clock, run repetitions times and
+// reported by its aggregates, the median among them, which the summaries
+// compare. Returns the registration for further settings.
+benchmark::internal::Benchmark* RegisterRepeated(const char* name, void (*fn)(benchmark::State&),
+                                                 int repetitions, benchmark::TimeUnit unit);
+
 // "met" or "MISSED", for the summary lines.
 const char* Verdict(bool met);
 

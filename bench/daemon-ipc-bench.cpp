@@ -71,11 +71,7 @@ void BM_RawRoundTrip(benchmark::State& state) {
 }
 
 void Register(const char* name, void (*fn)(benchmark::State&)) {
-  benchmark::RegisterBenchmark(name, fn)
-      ->Repetitions(9)
-      ->ReportAggregatesOnly(true)
-      ->UseRealTime()
-      ->Unit(benchmark::kMicrosecond);
+  plovo_bench::RegisterRepeated(name, fn, 9, benchmark::kMicrosecond);
 }
 
 }  // namespace

@@ -113,12 +113,7 @@ void BM_CpFsync(benchmark::State& state) {
 }
 
 void Register(const char* name, void (*fn)(benchmark::State&)) {
-  benchmark::RegisterBenchmark(name, fn)
-      ->Iterations(2)
-      ->Repetitions(9)
-      ->ReportAggregatesOnly(true)
-      ->UseRealTime()
-      ->Unit(benchmark::kMillisecond);
+  plovo_bench::RegisterRepeated(name, fn, 9, benchmark::kMillisecond)->Iterations(2);
 }
 
 double MiBps(double seconds) { return static_cast<double>(kFileSize) / seconds / (1 << 20); }

@@ -338,11 +338,7 @@ void BM_ListAnswer(benchmark::State& state) {
 }
 
 void Register(const char* name, void (*fn)(benchmark::State&)) {
-  benchmark::RegisterBenchmark(name, fn)
-      ->Repetitions(9)
-      ->ReportAggregatesOnly(true)
-      ->UseRealTime()
-      ->Unit(benchmark::kMicrosecond);
+  plovo_bench::RegisterRepeated(name, fn, 9, benchmark::kMicrosecond);
 }
 
 // The service state that lets every method through the gate.

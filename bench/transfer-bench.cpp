@@ -121,12 +121,7 @@ void BM_PStreamChannel(benchmark::State& state) {
 }
 
 void Register(const char* name, void (*fn)(benchmark::State&)) {
-  benchmark::RegisterBenchmark(name, fn)
-      ->Iterations(2)
-      ->Repetitions(5)
-      ->ReportAggregatesOnly(true)
-      ->UseRealTime()
-      ->Unit(benchmark::kMillisecond);
+  plovo_bench::RegisterRepeated(name, fn, 5, benchmark::kMillisecond)->Iterations(2);
 }
 
 }  // namespace
