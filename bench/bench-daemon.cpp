@@ -160,4 +160,10 @@ void ListenerServer::Serve(int fd) {
   peer.send(SameValue(request, expected_) ? reply_ : refusal_);
 }
 
+PObject AckReply() {
+  PObject reply;
+  reply["ack"] = "ok";
+  return reply;
+}
+
 }  // namespace plovo_bench

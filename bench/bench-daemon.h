@@ -114,6 +114,9 @@ class ListenerServer : public Server {
   IPCListener listener_;
 };
 
+// The daemon's answer to a command that succeeded: {"ack": "ok"}.
+PObject AckReply();
+
 }  // namespace plovo_bench
 
 #endif

@@ -32,14 +32,8 @@ PObject Request() {
   return request;
 }
 
-PObject Reply() {
-  PObject reply;
-  reply["ack"] = "ok";
-  return reply;
-}
-
 void BM_DaemonIPC(benchmark::State& state) {
-  plovo_bench::ListenerServer server(Request(), Reply());
+  plovo_bench::ListenerServer server(Request(), plovo_bench::AckReply());
   if (!server.Start()) {
     state.SkipWithError("cannot listen on the daemon socket");
     return;

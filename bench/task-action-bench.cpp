@@ -71,12 +71,6 @@ PObject ListCommand() {
   return command;
 }
 
-PObject Ack() {
-  PObject ack;
-  ack["ack"] = "ok";
-  return ack;
-}
-
 std::string TaskName(size_t n) { return "Camera card " + std::to_string(n) + " to photo library"; }
 
 // One task as the daemon lists it: every key the web record reads, with
@@ -121,7 +115,7 @@ PObject TaskMap(size_t n) {
 
 const PObject& ListReply() {
   static const PObject reply = [] {
-    PObject r = Ack();
+    PObject r = plovo_bench::AckReply();
     PObject::array_type& tasks = r["task_list"].asArray();
     for (size_t n = 0; n < kTasks; ++n) tasks.push_back(TaskMap(n));
     return r;
@@ -159,7 +153,7 @@ void BM_RawRoundTrip(benchmark::State& state) {
 }
 
 void BM_ProcessRun(benchmark::State& state) {
-  plovo_bench::ListenerServer server(RunCommand(), Ack());
+  plovo_bench::ListenerServer server(RunCommand(), plovo_bench::AckReply());
   if (!server.Start()) {
     state.SkipWithError("cannot listen on the daemon socket");
     return;
@@ -372,7 +366,7 @@ bool RawBytesMatchTheLibrary() {
     ::Process(&request, &response);
     if (!response.IsSuccess()) return false;
   }
-  plovo_bench::ListenerServer server(RunCommand(), Ack());
+  plovo_bench::ListenerServer server(RunCommand(), plovo_bench::AckReply());
   return server.Start() && plovo_bench::RawRoundTrip(Plovo::Path::DaemonSocket(), kRunBytes, kAckBytes);
 }
 
