@@ -288,6 +288,9 @@ int FSMKDir(const std::string& path, bool recursive, unsigned uid, unsigned gid)
     if (recursive ? FSMKDirP(path, uid, gid) != 0 : mkdir(path.c_str(), 0777) != 0) {
       if (!recursive) {  // FSMKDirP names the step that failed itself
         int err = errno;
+        // Another caller made it since the look above: it is there, and
+        // its owner is that caller's to set.
+        if (err == EEXIST && IsFolder(path)) return 0;
         PLOVO_LIB_ERR("FSMKDir: mkdir(%s): %s (%d)", path.c_str(), ErrText(err).text, err);
       }
       return -2;

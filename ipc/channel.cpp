@@ -122,14 +122,22 @@ bool TimeLimitPassed(Clock::time_point lastProgress, unsigned int limit) {
   return limit != 0 && Clock::now() - lastProgress >= std::chrono::seconds(limit);
 }
 
+bool DeadlinePassed(const Clock::time_point* deadline) { return deadline != nullptr && Clock::now() >= *deadline; }
+
 // The wait loop of every read: step() reads the socket once (a byte count
 // or a result code) and is repeated until want bytes came in total, the
-// time limit passed without a byte, or the cancel flag went up.
+// time limit passed without a byte, the deadline (when not null) passed, or
+// the cancel flag went up.
 template <typename Step, typename Cancelled>
-int ReadAtLeast(unsigned long want, unsigned int limit, Step step, Cancelled cancelled) {
+int ReadAtLeast(unsigned long want, unsigned int limit, const Clock::time_point* deadline, Step step,
+                Cancelled cancelled) {
   unsigned long total = 0;
   Clock::time_point lastProgress = Clock::now();
   while (!cancelled()) {
+    if (DeadlinePassed(deadline)) {
+      PLOVO_LIB_WARN("ReadMore: exchange deadline passed");
+      return P_ERR_TIMEOUT;
+    }
     long r = step();
     if (r > 0) {
       total += static_cast<unsigned long>(r);
@@ -268,7 +276,9 @@ int Channel::Open(const char* path) {
     PLOVO_LIB_WARN("Open: %s", PErrorText(P_ERR_INVALID_ARGUMENT));
     return P_ERR_INVALID_ARGUMENT;
   }
-  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  // Non-blocking from the start: a blocking connect to a peer whose listen
+  // queue is full would wait for ever, out of reach of every time limit.
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
   if (fd < 0) {
     PLOVO_LIB_WARN("Channel: Can not open socket. %s", strerror(errno));
     return P_ERR_SYSTEM;
@@ -355,6 +365,21 @@ int Channel::Close() {
 }
 
 void Channel::SetTimeout(unsigned int seconds) { m_timeout = seconds; }
+
+void Channel::SetDeadline(unsigned int seconds) {
+  m_has_deadline = seconds != 0;
+  m_deadline = Clock::now() + std::chrono::seconds(seconds);
+}
+
+timeval Channel::WaitInterval() const {
+  if (!m_has_deadline) return m_interval;
+  auto left = std::chrono::duration_cast<std::chrono::microseconds>(m_deadline - Clock::now()).count();
+  // At least a millisecond: a zero timeval would make the wait a busy poll.
+  left = std::max<long long>(left, 1000);
+  long long interval = m_interval.tv_sec * 1000000LL + m_interval.tv_usec;
+  if (left >= interval) return m_interval;
+  return timeval{static_cast<time_t>(left / 1000000), static_cast<suseconds_t>(left % 1000000)};
+}
 
 void Channel::SetFlag(int* flag) { m_flag = flag; }
 
@@ -503,7 +528,7 @@ int Channel::Read(char* buf, unsigned long n, unsigned long& got) {
     // A large remainder goes straight into the caller's memory, which saves
     // copying bulk data through the ring; the bytes and results are the same.
     int r = ReadAtLeast(
-        left, m_timeout,
+        left, m_timeout, m_has_deadline ? &m_deadline : nullptr,
         [&] {
           long k = m_ops->read(*this, buf + got, n - got);
           if (k > 0) got += static_cast<unsigned long>(k);
@@ -562,6 +587,10 @@ int Channel::FlushWrite(unsigned long atLeast) {
   unsigned long sent = 0;
   Clock::time_point lastProgress = Clock::now();
   while (!Cancelled()) {
+    if (DeadlinePassed(m_has_deadline ? &m_deadline : nullptr)) {
+      PLOVO_LIB_WARN("FlushWrite: exchange deadline passed");
+      return P_ERR_TIMEOUT;
+    }
     unsigned long chunk = std::min(m_wsize, m_capacity - m_whead);
     long r = m_ops->write(*this, m_wbuf + m_whead, chunk);
     if (r > 0) {
@@ -622,7 +651,7 @@ int Channel::ReadMore(unsigned long want) {
     return P_ERR_INVALID_ARGUMENT;
   }
   return ReadAtLeast(
-      want, m_timeout,
+      want, m_timeout, m_has_deadline ? &m_deadline : nullptr,
       [this] {
         if (m_rsize == 0) m_rhead = 0;  // one contiguous free block
         unsigned long tail = m_rhead + m_rsize;
@@ -684,10 +713,10 @@ int Channel::ConnectWithTimeout(int fd, const char* ip, int port) {
   // connect gives up after a third of the time limit in rounds.
   unsigned int elapsed = 0;
   for (;;) {
-    int r = WaitFd(fd, true, m_interval);
+    int r = WaitFd(fd, true, WaitInterval());
     if (r == kWaitTimeout) {
       elapsed += 3;
-      if (m_timeout != 0 && elapsed >= m_timeout) {
+      if ((m_timeout != 0 && elapsed >= m_timeout) || DeadlinePassed(m_has_deadline ? &m_deadline : nullptr)) {
         PLOVO_LIB_WARN("Channel timed out during connect (%d seconds), abort anyway", static_cast<int>(m_timeout));
         return P_ERR_TIMEOUT;
       }
@@ -742,7 +771,7 @@ long Channel::PlainRead(Channel& ch, char* buf, unsigned long n) {
       return P_ERR_IO;
     }
     if (waited) return P_ERR_TIMEOUT;  // ready but still empty: let the caller count the round
-    if (long w = WaitForSocket(fd, false, ch.m_interval); w != P_SUCCESS) return w;
+    if (long w = WaitForSocket(fd, false, ch.WaitInterval()); w != P_SUCCESS) return w;
     waited = true;
   }
 }
@@ -769,7 +798,7 @@ long Channel::PlainWrite(Channel& ch, const char* buf, unsigned long n) {
       return P_ERR_IO;
     }
     if (waited) return P_ERR_TIMEOUT;
-    if (long w = WaitForSocket(fd, true, ch.m_interval); w != P_SUCCESS) return w;
+    if (long w = WaitForSocket(fd, true, ch.WaitInterval()); w != P_SUCCESS) return w;
     waited = true;
   }
 }
@@ -818,7 +847,7 @@ long Channel::TlsRead(Channel& ch, char* buf, unsigned long n) {
       PLOVO_LIB_DBG("SSL want read");
       return P_ERR_TIMEOUT;
     }
-    if (long w = WaitForSocket(SSL_get_fd(ssl), error == SSL_ERROR_WANT_WRITE, ch.m_interval); w != P_SUCCESS) {
+    if (long w = WaitForSocket(SSL_get_fd(ssl), error == SSL_ERROR_WANT_WRITE, ch.WaitInterval()); w != P_SUCCESS) {
       return w;
     }
   }
@@ -848,7 +877,7 @@ long Channel::TlsWrite(Channel& ch, const char* buf, unsigned long n) {
         PLOVO_LIB_DBG("SSL want write");
         return P_ERR_TIMEOUT;
       }
-      if (long w = WaitForSocket(SSL_get_fd(ssl), error == SSL_ERROR_WANT_WRITE, ch.m_interval); w != P_SUCCESS) {
+      if (long w = WaitForSocket(SSL_get_fd(ssl), error == SSL_ERROR_WANT_WRITE, ch.WaitInterval()); w != P_SUCCESS) {
         return w;
       }
       continue;

@@ -1,6 +1,5 @@
 #include "ipc/plovo-command.h"
 
-#include "common/file-op.h"
 #include "common/log.h"
 #include "common/utility.h"
 #include "common/velt-sdk-wrapper.h"
@@ -137,12 +136,12 @@ int CreateTaskCmd(const TaskSetting& task, const TriggerTimeSetting& trigger,
     PLOVO_LIB_ERR("Failed to get uuid for dev_path '%s'", devPath.c_str());
     // The identity goes onto the device itself, so that the device is
     // recognised by the same identity in any NAS it is plugged into.
-    uuid = SDK::GenerateUUID();
-    if (WritePlovoConfig(sharePath, "uuid", uuid) < 0) {
+    const int made = SDK::GetOrCreateUUID(sharePath, devPath, uuid);
+    if (made < 0) {
       PLOVO_LIB_ERR("Failed to write Plovo config '%s', uuid '%s'", sharePath.c_str(), uuid.c_str());
       return -1;
     }
-    PLOVO_LIB_WARN("write uuid '%s' to config file", uuid.c_str());
+    if (made == 1) PLOVO_LIB_WARN("write uuid '%s' to config file", uuid.c_str());
   }
   std::string producer, product;
   if (GetUSBProducerProduct(task.usb_share_name, producer, product) < 0) {

@@ -1,5 +1,6 @@
 #include "ipc/stream.h"
 
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -107,7 +108,8 @@ std::string PStream::Indent() const { return std::string(2 * std::min<uint64_t>(
 
 int PStream::Send(Channel& ch, const PObject& value) {
   m_trace = Plovo::LogWillWrite(LOG_DEBUG);
-  int ret = SendObject(ch, value);
+  int ret = CheckSendable(value, 0);
+  if (ret == 0) ret = SendObject(ch, value);
   if (ret == 0) {
     int flushed = ch.FlushWrite(0);
     if (flushed != 0) {
@@ -116,9 +118,70 @@ int PStream::Send(Channel& ch, const PObject& value) {
     }
   } else {
     DumpHistory();
+    // What a failed value left in the buffer must not go out when the
+    // channel closes: the peer would take a cut message for a whole one.
+    ch.ClearWrite();
   }
   ClearHistory();
   return ret;
+}
+
+// Everything that can make a value unsendable without the peer's doing is
+// found here, so that a refused value puts no byte on the wire. The key
+// path of the offending value stays on the stack for DumpHistory.
+int PStream::CheckSendable(const PObject& value, uint64_t depth) {
+  if (value.isString()) {
+    // A longer string cannot state its length in 16 bits; the peer would
+    // read the rest of it as values.
+    if (value.asStringRef().size() > kMaxString) {
+      PLOVO_LIB_ERR("PStream: string of %zu bytes exceeds %zu", value.asStringRef().size(), kMaxString);
+      return P_ERR_INVALID_ARGUMENT;
+    }
+    return 0;
+  }
+  if (value.isBinary()) {
+    const PObject::binary_type& binary = value.asBinary();
+    struct stat st;
+    if (stat(binary.path.c_str(), &st) != 0) {
+      PLOVO_LIB_ERR("fopen(%s) error", binary.path.c_str());
+      return P_ERR_INTERRUPTED;
+    }
+    if (S_ISREG(st.st_mode) && static_cast<uint64_t>(st.st_size) < binary.offset + binary.length) {
+      PLOVO_LIB_ERR("file length is incorrect.");
+      return P_ERR_TIMEOUT;
+    }
+    return 0;
+  }
+  if (value.isBuffer()) {
+    PLOVO_LIB_ERR("PStream: type %s has no wire form", "buffer");
+    return P_ERR_INTERRUPTED;
+  }
+  if (!value.isMap() && !value.isArray()) return 0;
+  // The peer refuses deeper nesting, and this walk must not recurse
+  // without bound either.
+  if (depth >= kMaxDepth) {
+    PLOVO_LIB_ERR("PStream: containers nested deeper than %lu", static_cast<unsigned long>(kMaxDepth));
+    return P_ERR_TIMEOUT;
+  }
+  if (value.isArray()) {
+    for (const PObject& element : value.asArray()) {
+      if (int r = CheckSendable(element, depth + 1); r != 0) return r;
+    }
+    return 0;
+  }
+  PushHistory();
+  for (const auto& [key, member] : value.asMap()) {
+    std::string_view wireKey = key;
+    if (!wireKey.empty() && wireKey[0] == '_') wireKey.remove_prefix(1);
+    SetHistoryTop(wireKey);
+    if (wireKey.size() > kMaxString) {
+      PLOVO_LIB_ERR("PStream: key of %zu bytes exceeds %zu", wireKey.size(), kMaxString);
+      return P_ERR_INVALID_ARGUMENT;
+    }
+    if (int r = CheckSendable(member, depth + 1); r != 0) return r;
+  }
+  PopHistory();
+  return 0;
 }
 
 int PStream::SendObject(Channel& ch, const PObject& value) {
@@ -150,12 +213,7 @@ int PStream::Send(Channel& ch, uint64_t number) {
 }
 
 int PStream::Send(Channel& ch, std::string_view text) {
-  // A longer string cannot state its length; refusing it before any byte
-  // leaves keeps the peer from reading the rest of the string as values.
-  if (text.size() > kMaxString) {
-    PLOVO_LIB_ERR("PStream: string of %zu bytes exceeds %zu", text.size(), kMaxString);
-    return P_ERR_INVALID_ARGUMENT;
-  }
+  // CheckSendable has refused longer strings.
   unsigned char head[3] = {TAG_STRING, static_cast<unsigned char>(text.size() >> 8),
                            static_cast<unsigned char>(text.size())};
   if (int r = ch.Write(reinterpret_cast<const char*>(head), sizeof(head)); r != 0) return ChannelFailure(r);
@@ -261,6 +319,7 @@ int PStream::Send(Channel& ch, const PObject::binary_type& binary) {
 int PStream::Recv(Channel& ch, PObject& target) {
   m_trace = Plovo::LogWillWrite(LOG_DEBUG);
   m_depth = 0;
+  m_used = 0;
   int ret = RecvObject(ch, target);
   if (ret != 0) DumpHistory();
   ClearHistory();
@@ -278,7 +337,15 @@ int PStream::RecvObject(Channel& ch, PObject& target) {
   return ret != 0 ? ret : RecvDispatch(ch, tag, target);
 }
 
+bool PStream::Charge(uint64_t bytes) {
+  m_used += bytes;
+  if (m_used <= m_max_size) return true;
+  PLOVO_LIB_ERR("PStream: message exceeds %lu bytes", static_cast<unsigned long>(m_max_size));
+  return false;
+}
+
 int PStream::RecvDispatch(Channel& ch, uint8_t tag, PObject& target) {
+  if (!Charge(kValueCharge)) return P_ERR_INVALID_ARGUMENT;
   int ret;
   switch (tag) {
     case TAG_STRING: {
@@ -334,6 +401,7 @@ int PStream::Recv(Channel& ch, uint64_t& number) {
 int PStream::Recv(Channel& ch, std::string& text) {
   unsigned short length = 0;
   int ret = ch.ReadInt16(&length);
+  if (ret == 0 && !Charge(length)) return P_ERR_INVALID_ARGUMENT;
   if (ret == 0) {
     text.resize(length);
     // Read in blocks: a channel reads at most its capacity at a time.
@@ -442,6 +510,12 @@ int OpenRecvFile(PObject::binary_type& binary, const std::string& location, File
 }  // namespace
 
 int PStream::Recv(Channel& ch, PObject::binary_type& binary) {
+  // A file goes only where the caller said files may go; a target without
+  // a file of its own and no receive folder has no such place.
+  if (binary.path.empty() && m_recv_location.empty()) {
+    PLOVO_LIB_ERR("PStream: a received file has no folder to go to");
+    return P_ERR_INVALID_ARGUMENT;
+  }
   unsigned long length = 0;
   uint64_t stored = 0;
   File file;

@@ -2,18 +2,48 @@
 
 #include <fcntl.h>
 #include <sys/file.h>
+#include <sys/stat.h>
 #include <unistd.h>
 #include <velt/mount.h>
 #include <velt/vlibc.h>
 
+#include <atomic>
+#include <cerrno>
+#include <chrono>
 #include <cstdlib>
 #include <exception>
+#include <thread>
 
 #include "common/log.h"
 #include "common/paths.h"
 #include "common/utility.h"
 
 namespace {
+
+// A holder keeps "status.lock" for one read or write of two short lines, so
+// a longer wait means a stuck holder: the request then fails (the gate
+// answers "not ready") instead of hanging its server thread.
+constexpr std::chrono::milliseconds kStatusLockWait = std::chrono::seconds(5);
+// flock has no timeout; a waiter retries at this pace until its deadline.
+constexpr std::chrono::milliseconds kStatusLockRetry{1};
+
+std::atomic<std::chrono::milliseconds::rep> gStatusLockWaitMs{kStatusLockWait.count()};
+
+// Takes the exclusive flock on fd, giving up after wait. False on timeout
+// (*timedOut set) or on any other flock failure.
+bool LockWithin(int fd, std::chrono::milliseconds wait, bool* timedOut) {
+  const auto deadline = std::chrono::steady_clock::now() + wait;
+  *timedOut = false;
+  while (flock(fd, LOCK_EX | LOCK_NB) != 0) {
+    if (errno != EWOULDBLOCK && errno != EINTR) return false;
+    if (std::chrono::steady_clock::now() >= deadline) {
+      *timedOut = true;
+      return false;
+    }
+    std::this_thread::sleep_for(kStatusLockRetry);
+  }
+  return true;
+}
 
 // Holds the exclusive lock on "status.lock" for one read or write of the
 // status file.
@@ -25,8 +55,14 @@ class StatusLock {
       PLOVO_LOG(LOG_ERR, "Failed to open plovo status lock file.");
       return;
     }
-    if (flock(fd_, LOCK_EX) != 0) {
+    const std::chrono::milliseconds wait(gStatusLockWaitMs.load());
+    bool timedOut = false;
+    if (!LockWithin(fd_, wait, &timedOut)) {
       PLOVO_LOG(LOG_ERR, "Failed to lock file.");
+      if (timedOut) {
+        PLOVO_LOG(LOG_ERR, "The plovo status lock is still held after %lld ms.",
+                  static_cast<long long>(wait.count()));
+      }
       return;
     }
     locked_ = true;
@@ -49,7 +85,24 @@ class StatusLock {
 // The status file's values fit easily; the buffer size is the file format's.
 constexpr size_t kStatusValueSize = 1024;
 
+// The status file is read or replaced only when it is a plain file (or
+// missing, which the key/value calls report themselves): a FIFO would block
+// the request for good, a device such as /dev/zero would be read without
+// end, and a symbolic link could lead to either. Only root and the package
+// may write its folder, so the file is not swapped between this check and
+// the read.
+bool StatusFileIsPlain(const std::string& file) {
+  struct stat st;
+  if (lstat(file.c_str(), &st) != 0 || S_ISREG(st.st_mode)) return true;
+  PLOVO_LOG(LOG_ERR, "Plovo status file is not a regular file.");
+  return false;
+}
+
 }  // namespace
+
+void SetServiceStatusLockWait(std::chrono::milliseconds wait) {
+  gStatusLockWaitMs.store(wait.count() > 0 ? wait.count() : kStatusLockWait.count());
+}
 
 ServiceStatus::ServiceStatus() : state(PLOVO_SERVICE_STATUS_UNKNOWN) {}
 ServiceStatus::~ServiceStatus() = default;
@@ -61,6 +114,7 @@ int ReadServiceStatus(ServiceStatus& status) {
   if (!lock.locked()) return -1;
 
   const std::string file = Plovo::Path::StatusFile();
+  if (!StatusFileIsPlain(file)) return -1;
   char value[kStatusValueSize] = {};
   if (VLIBCFileGetKeyValue(file.c_str(), "state", value, sizeof(value), 0) < 1) {
     PLOVO_LOG(LOG_ERR, "Failed to get plovo service state.");
@@ -81,6 +135,7 @@ int WriteServiceStatus(const ServiceStatus& status) {
   if (!lock.locked()) return -1;
 
   const std::string file = Plovo::Path::StatusFile();
+  if (!StatusFileIsPlain(file)) return -1;
   const std::string state = Plovo::NumToString(status.state);
   if (VLIBCFileSetKeyValue(file.c_str(), "state", state.c_str(), "%s=\"%s\"\n") < 0) {
     PLOVO_LOG(LOG_ERR, "Failed to set plovo service state to [%d].", status.state);

@@ -17,6 +17,7 @@
 #include <velt/webapi.h>
 
 #include <cstring>
+#include <exception>
 #include <iostream>
 #include <memory>
 #include <sstream>
@@ -26,6 +27,11 @@ namespace {
 
 constexpr const char* kApiName = "VELT.Plovo";
 constexpr int kUnanswered = 100;
+// The parser recurses once per level; past this depth it refuses the text
+// instead of running deep into the stack. Well above the request's own
+// bound (VELT::kMaxParamDepth), so that the module's answer to parameters
+// nested too deeply can be seen from here.
+constexpr int kParamsStackLimit = 256;
 
 int Usage(const std::string& why) {
   std::cerr << "plovo-api: " << why << "\n"
@@ -41,6 +47,24 @@ std::string DefaultModulePath() {
   std::string dir(self, static_cast<size_t>(n));
   dir.erase(dir.rfind('/'));
   return dir + "/../lib/libplovo-webapi.so";
+}
+
+// Parses the PARAMS_JSON argument; false, with the reason in *why, when it
+// is not a JSON object the reader accepts.
+bool ParseParams(const char* text, Json::Value* params, std::string* why) {
+  Json::CharReaderBuilder reader;
+  Json::CharReaderBuilder::strictMode(&reader.settings_);
+  reader["stackLimit"] = kParamsStackLimit;
+  std::istringstream in(text);
+  try {
+    if (!Json::parseFromStream(reader, in, params, why)) return false;
+  } catch (const std::exception& e) {  // the reader throws past its stack limit
+    *why = e.what();
+    return false;
+  }
+  if (params->isObject()) return true;
+  *why = "not an object";
+  return false;
 }
 
 std::string Compact(const Json::Value& value) {
@@ -68,12 +92,10 @@ int main(int argc, char** argv) {
   const std::string method = argv[arg++];
   Json::Value params(Json::objectValue);
   if (arg < argc) {
-    Json::CharReaderBuilder reader;
-    Json::CharReaderBuilder::strictMode(&reader.settings_);
-    std::string errors;
-    std::istringstream text(argv[arg++]);
-    if (!Json::parseFromStream(reader, text, &params, &errors) || !params.isObject()) {
-      return Usage("PARAMS_JSON must be a JSON object");
+    std::string why;
+    if (!ParseParams(argv[arg++], &params, &why)) {
+      while (!why.empty() && why.back() == '\n') why.pop_back();
+      return Usage("PARAMS_JSON must be a JSON object: " + why);
     }
   }
   if (arg < argc) return Usage("too many arguments");

@@ -1,6 +1,8 @@
 #include "webapi/plovo.h"
 
+#include <algorithm>
 #include <exception>
+#include <vector>
 
 #include "common/log.h"
 #include "common/run-as.h"
@@ -106,6 +108,11 @@ void PlovoHandle::HandleAction() {
   const std::string method = request->GetAPIMethod();
   for (const ActionRow* row = kActions; row->action != nullptr; ++row) {
     if (method == row->method) {
+      if (HasZeroByte(request->GetParams())) {
+        PLOVO_LOG(LOG_ERR, "A parameter of '%s' holds a zero byte", method.c_str());
+        response->SetError(402);
+        return;
+      }
       (this->*(row->action))();
       return;
     }
@@ -162,4 +169,31 @@ bool IsSafePath(const std::string& path) {
     }
   }
   return true;
+}
+
+bool IsSafeShareName(const std::string& name) {
+  return !name.empty() && name != "." && name != ".." && name.find_first_of(std::string("/\0", 2)) == std::string::npos;
+}
+
+bool HasZeroByte(const Json::Value& params) {
+  // A loop over an explicit list rather than recursion: the depth of the
+  // parameters is the client's choice.
+  std::vector<const Json::Value*> pending{&params};
+  while (!pending.empty()) {
+    const Json::Value& value = *pending.back();
+    pending.pop_back();
+    if (value.isString()) {
+      const char* begin = nullptr;
+      const char* end = nullptr;
+      if (value.getString(&begin, &end) && std::find(begin, end, '\0') != end) return true;
+    } else if (value.isObject()) {
+      for (auto it = value.begin(); it != value.end(); ++it) {
+        if (it.name().find('\0') != std::string::npos) return true;
+        pending.push_back(&*it);
+      }
+    } else if (value.isArray()) {
+      for (const Json::Value& element : value) pending.push_back(&element);
+    }
+  }
+  return false;
 }

@@ -44,7 +44,7 @@ void PlovoHandle::Cancel() {
   // Cancelling a task that is not running leaves it as the user wants it.
   if (daemon.SendCommand(command, reply) < 0 &&
       !(reply.hasMember("error_code") && reply["error_code"].asInt32() == kNothingToCancel)) {
-    PLOVO_LOG(LOG_ERR, "Failed to send task command, res=[%s]", reply.toString().c_str());
+    PLOVO_LOG(LOG_ERR, "Failed to send task command, res=[%s]", DaemonIPC::LogText(reply).c_str());
     response->SetError(GetErrorCodeFromResponse(reply));
     return;
   }

@@ -175,7 +175,7 @@ int PlovoHandle::SendToDaemon(const PObject& command, PObject& reply, const char
   DaemonIPC daemon;
   if (daemon.SendCommand(command, reply) >= 0) return 0;
   Plovo::LogWrite(LOG_ERR, "%s:%d Failed to send %s command, res=[%s]", Plovo::LogBaseName(file),
-                  line, what, reply.toString().c_str());
+                  line, what, DaemonIPC::LogText(reply).c_str());
   return GetErrorCodeFromResponse(reply);
 }
 

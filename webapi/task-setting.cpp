@@ -165,7 +165,8 @@ void PlovoHandle::Create() {
     response->SetError(402);
     return;
   }
-  if (!IsSafePath(setting.usb_folder_path) || !IsSafePath(setting.nas_folder_path)) {
+  if (!IsSafeShareName(setting.usb_share_name) || !IsSafeShareName(setting.nas_share_name) ||
+      !IsSafePath(setting.usb_folder_path) || !IsSafePath(setting.nas_folder_path)) {
     response->SetError(414);
     return;
   }
@@ -213,7 +214,9 @@ void PlovoHandle::SetSetting() {
     response->SetError(402);
     return;
   }
-  if (!IsSafePath(setting.usb_folder_path) || !IsSafePath(setting.nas_folder_path)) {
+  // The device's share is the existing task's own and is not read here.
+  if (!IsSafeShareName(setting.nas_share_name) || !IsSafePath(setting.usb_folder_path) ||
+      !IsSafePath(setting.nas_folder_path)) {
     response->SetError(414);
     return;
   }

@@ -6,8 +6,9 @@
 // Writes collect in a write buffer and leave on FlushWrite (or when the
 // buffer must make room); reads pull whole buffer-loads into a read ring.
 // Every wait on the socket is a select() with a short interval (1 second),
-// repeated until the overall time limit (60 seconds, 0 = none) passes
-// without progress or until the caller's cancel flag is raised. The socket
+// repeated until the time limit (60 seconds, 0 = none) passes without
+// progress, until the deadline (none unless set) passes whatever the
+// progress, or until the caller's cancel flag is raised. The socket
 // is read or written at once when it is ready; select() is used only when
 // it is not.
 //
@@ -27,6 +28,7 @@
 #include <openssl/ssl.h>
 #include <sys/time.h>
 
+#include <chrono>
 #include <string>
 
 class Channel {
@@ -38,7 +40,8 @@ class Channel {
   Channel(const Channel&) = delete;
   Channel& operator=(const Channel&) = delete;
 
-  // Connects a Unix domain stream socket to path. -3 when no socket can be
+  // Connects a Unix domain stream socket to path, without blocking: a peer
+  // whose listen queue is full fails at once. -3 when no socket can be
   // made or set non-blocking, -2 when the connect fails. Does not refuse an
   // already open channel.
   virtual int Open(const char* path);
@@ -54,6 +57,12 @@ class Channel {
   virtual int Close();
   // The overall time limit in seconds; 0 waits without limit.
   virtual void SetTimeout(unsigned int seconds);
+  // Every read, flush and connect must end within seconds from now (0: no
+  // deadline): -5 once it passes. Unlike the time limit, progress does not
+  // extend it, so a peer that sends a byte now and then cannot hold an
+  // exchange open. Not virtual: it is no part of the channel's interface to
+  // subclasses.
+  void SetDeadline(unsigned int seconds);
   // Installs the caller-owned cancel flag (null: none).
   virtual void SetFlag(int* flag);
   // Runs the TLS handshake on the open descriptor, as the server or the
@@ -147,6 +156,8 @@ class Channel {
   static void log_ssl();
   // The flag is written by another thread, hence the atomic read.
   bool Cancelled() const { return m_flag != nullptr && __atomic_load_n(m_flag, __ATOMIC_RELAXED) != 0; }
+  // The interval of one wait, cut short to what is left before the deadline.
+  timeval WaitInterval() const;
 
   void* m_handle = nullptr;  // plain: int* holding the descriptor; TLS: SSL*
   const Ops* m_ops = &kPlainOps;
@@ -160,6 +171,8 @@ class Channel {
   timeval m_interval{1, 0};
   unsigned int m_timeout = 60;
   int* m_flag = nullptr;
+  bool m_has_deadline = false;
+  std::chrono::steady_clock::time_point m_deadline;
   bool m_ssl = false;
   bool m_allow_untrust = true;
   // Whether the per-call debug lines are written; decided once per channel

@@ -15,11 +15,19 @@
 // members the stream does not mention, an array gets the new elements
 // appended. Receive into a fresh PObject for a clean result.
 //
-// A received binary (file transfer) is stored in the target's file: with
-// offset 0 the file is re-created; with a non-zero offset the new bytes
-// follow the offset (the file is first cut to the offset when its recorded
-// length differs), so an interrupted transfer can be resumed. A target
-// without a path gets a temporary name in the default receive location.
+// A received binary (file transfer) is stored in the target's own file when
+// the caller named one: with offset 0 the file is re-created; with a
+// non-zero offset the new bytes follow the offset (the file is first cut to
+// the offset when its recorded length differs), so an interrupted transfer
+// can be resumed. A target without a path gets a temporary name inside the
+// receive folder the caller set; without one the binary is refused (-4) and
+// nothing is written anywhere, which is what a peer's answer to a command
+// gets.
+//
+// A received message may hold at most the size bound (64 MiB by default) in
+// memory, counted as its strings' bytes plus a fixed charge for each value;
+// a larger one is refused (-4) before anything beyond the bound is
+// allocated. The contents of received files go to disk and do not count.
 //
 // Threading: one stream serves one exchange on one thread; GetStatus,
 // GetHistory and DumpHistory may be called from another thread meanwhile.
@@ -52,6 +60,12 @@ class PStream {
   static constexpr uint64_t kMaxDepth = 64;
   // Block size of binary transfers, the channel capacity of the endpoints.
   static constexpr uint64_t kBlockSize = 81920;
+  // The default size bound of a received message, and what each received
+  // value counts towards it besides its string bytes (about what a value
+  // costs in memory, so that a message of many tiny values cannot grow the
+  // process far beyond its wire size).
+  static constexpr uint64_t kMaxMessageSize = 64ull << 20;
+  static constexpr uint64_t kValueCharge = 64;
 
   PStream() = default;
   PStream(const PStream&) = delete;
@@ -65,8 +79,11 @@ class PStream {
   // Reads one value into target (merging, see above).
   int Recv(Channel& ch, PObject& target);
 
-  // Folder for received binaries that name no file.
+  // Folder for received binaries that name no file; empty (the default)
+  // refuses them.
   void SetDefaultRecvLocation(const std::string& dir) { m_recv_location = dir; }
+  // The size bound of each received message (see above).
+  void SetMaxMessageSize(uint64_t bytes) { m_max_size = bytes; }
 
   // The key path being sent, joined with ".", and the progress of the
   // binary transfer under way (bytes done, bytes total).
@@ -95,7 +112,12 @@ class PStream {
   int Send(Channel& ch, const PObject::map_type& map);
   int Send(Channel& ch, const PObject::array_type& array);
 
+  // Refuses a value that is not sendable, before any byte is written.
+  int CheckSendable(const PObject& value, uint64_t depth);
+
   int RecvObject(Channel& ch, PObject& target);
+  // Counts bytes of the message being received against the size bound.
+  bool Charge(uint64_t bytes);
   int RecvTag(Channel& ch, uint8_t& tag);
   int RecvDispatch(Channel& ch, uint8_t tag, PObject& target);
   int Recv(Channel& ch, std::string& text);
@@ -123,6 +145,8 @@ class PStream {
   std::mutex m_mutex;
   uint64_t m_depth = 0;
   std::string m_recv_location;
+  uint64_t m_max_size = kMaxMessageSize;
+  uint64_t m_used = 0;  // of the message being received
   // Whether the per-value debug trace is written; decided once per message.
   bool m_trace = false;
 };

@@ -10,6 +10,7 @@
 #ifndef PLOVO_SERVICE_SERVICE_CTRL_H
 #define PLOVO_SERVICE_SERVICE_CTRL_H
 
+#include <chrono>
 #include <string>
 
 #include "common/export.h"
@@ -37,14 +38,19 @@ struct ServiceStatus {
 };
 
 // Reads both keys under the lock into status. Returns 0, or -1 when the lock
-// file cannot be opened or locked or either key cannot be read (a state read
-// before the failure stays in status.state).
+// file cannot be opened or locked within the lock wait (5 seconds), the
+// status file exists but is not a regular file, or either key cannot be
+// read (a state read before the failure stays in status.state).
 PLOVO_EXPORT int GetServiceStatus(ServiceStatus& status);
 
 // Writes both keys under the lock. Returns 0, or -1 when the lock cannot be
-// taken or a key cannot be written ("error" is not written after a failed
-// "state").
+// taken within the lock wait, the status file is not a regular file, or a
+// key cannot be written ("error" is not written after a failed "state").
 PLOVO_EXPORT int SetServiceStatus(const ServiceStatus& status);
+
+// Replaces the 5-second wait for "status.lock" in every later read and
+// write; zero or less restores it. For tests, which cannot wait that long.
+void SetServiceStatusLockWait(std::chrono::milliseconds wait);
 
 // True when the package is enabled ("/var/packages/Plovo/enabled" exists).
 bool IsPkgEnable();

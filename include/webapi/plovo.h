@@ -55,7 +55,9 @@ class PlovoHandle {
   // Always true: the web server has checked the user before the module.
   bool IsPermissionAllow();
   // Runs the action named by the request's method (exact, case-sensitive
-  // match), or answers 401 "Unknown request".
+  // match), or answers 401 "Unknown request". A request whose parameters
+  // hold a string with a zero byte answers 402 before the action looks at
+  // any of them.
   void HandleAction();
 
   // The task enumerations as the web API carries them.
@@ -151,5 +153,15 @@ int GetErrorCodeFromResponse(const PObject& reply);
 // False when a component of path (between '/' characters) is ".", ".." or
 // holds a ':'. Empty components, and so the empty path, are safe.
 bool IsSafePath(const std::string& path);
+
+// False for a share name that could name anything but one share: empty,
+// "." or "..", or holding a '/' or a zero byte.
+bool IsSafeShareName(const std::string& name);
+
+// True when a string of params, a value or a member name at any depth,
+// holds a zero byte. Such a string would be cut short wherever it travels
+// as a C string (the daemon ends received strings at their first zero
+// byte), so that what the checks saw is not what is used.
+bool HasZeroByte(const Json::Value& params);
 
 #endif

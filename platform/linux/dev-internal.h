@@ -28,8 +28,15 @@ int LastErrorLine();
 // then holds the switch's code.
 bool FaultHit(const char* call, const char* file, int line);
 
+// The largest file ReadWholeFile reads. Every file the platform reads (key
+// and pid files, its JSON state) holds a few lines; anything bigger is not
+// one of them.
+constexpr off_t kMaxFileSize = 1 << 20;
+
 // Reads the whole file into *out and, when st is not null, its stat.
-// Returns 0 or the errno of the failing step.
+// Returns 0 or the errno of the failing step: EINVAL for anything but a
+// regular file (a FIFO, a device, a folder; never waited for), EFBIG for a
+// file over kMaxFileSize.
 int ReadWholeFile(const std::string& path, std::string* out, struct stat* st);
 
 // Replaces file by data through a temporary file in the same folder, so

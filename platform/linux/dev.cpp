@@ -93,15 +93,27 @@ bool FaultHit(const char* call, const char* file, int line) {
 
 int ReadWholeFile(const std::string& path, std::string* out, struct stat* st) {
   out->clear();
-  int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  // O_NONBLOCK: opening a FIFO would otherwise wait for a writer. It changes
+  // nothing for the regular files read below.
+  int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
   if (fd < 0) return errno;
+  struct stat own;
+  if (!st) st = &own;
   int result = 0;
-  if (st && fstat(fd, st) != 0) result = errno;
+  if (fstat(fd, st) != 0) {
+    result = errno;
+  } else if (!S_ISREG(st->st_mode)) {
+    result = EINVAL;
+  } else if (st->st_size > kMaxFileSize) {
+    result = EFBIG;
+  }
   char buf[8192];
   while (result == 0) {
     ssize_t n = read(fd, buf, sizeof buf);
     if (n > 0) {
       out->append(buf, static_cast<size_t>(n));
+      // The file may have grown since fstat.
+      if (out->size() > static_cast<size_t>(kMaxFileSize)) result = EFBIG;
     } else if (n == 0) {
       break;
     } else if (errno != EINTR) {
@@ -109,6 +121,7 @@ int ReadWholeFile(const std::string& path, std::string* out, struct stat* st) {
     }
   }
   close(fd);
+  if (result != 0) out->clear();
   return result;
 }
 

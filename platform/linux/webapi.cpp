@@ -4,6 +4,7 @@
 #include <limits>
 #include <type_traits>
 #include <utility>
+#include <vector>
 
 namespace VELT {
 namespace {
@@ -14,13 +15,30 @@ const Json::Value* FindParam(const Json::Value& params, const std::string& key) 
   return params.find(key.data(), key.data() + key.size());
 }
 
+// True when value nests more than limit objects and arrays in one another.
+// Walked with an explicit stack: the value may be too deep for recursion,
+// which is what is being checked.
+bool NestedDeeperThan(const Json::Value& value, int limit) {
+  std::vector<std::pair<const Json::Value*, int>> pending{{&value, 1}};
+  while (!pending.empty()) {
+    const auto [node, depth] = pending.back();
+    pending.pop_back();
+    if (!node->isArray() && !node->isObject()) continue;
+    if (depth > limit) return true;
+    for (const Json::Value& child : *node) pending.emplace_back(&child, depth + 1);
+  }
+  return false;
+}
+
 // The common rules: absent is invalid only when required; present with the
 // wrong type, or refused by the validator, is invalid; an invalid or absent
-// parameter carries the type's default value.
+// parameter carries the type's default value. Null params (parameters
+// refused as a whole) make every parameter invalid.
 template <typename T, typename Convert>
-APIParameter<T> Check(const Json::Value& params, const std::string& key, PARAM_NECESSITY necessity,
+APIParameter<T> Check(const Json::Value* params, const std::string& key, PARAM_NECESSITY necessity,
                       APIRequest::Validator<T> validator, Convert convert) {
-  const Json::Value* value = FindParam(params, key);
+  if (!params) return APIParameter<T>(true, false, T{});
+  const Json::Value* value = FindParam(*params, key);
   if (!value) return APIParameter<T>(necessity == PARAM_REQUIRED, false, T{});
   T converted{};
   if (!convert(*value, &converted)) return APIParameter<T>(true, true, T{});
@@ -56,12 +74,20 @@ APIRequest::APIRequest(std::string api, int version, std::string method, Json::V
     : api_(std::move(api)),
       version_(version),
       method_(std::move(method)),
-      params_(std::move(params)) {}
+      params_(std::move(params)) {
+  // The value is dropped by jsoncpp's recursive destructor: a host hands
+  // over only what its own parser (bounded by its stack limit) and copies
+  // have already been through, so that depth is safe here too.
+  if (NestedDeeperThan(params_, kMaxParamDepth)) {
+    params_ = Json::Value();
+    paramsTooDeep_ = true;
+  }
+}
 
 template <typename T>
 APIParameter<T> APIRequest::GetAndCheckIntegral(const std::string& key, PARAM_NECESSITY necessity,
                                                 Validator<T> validator) const {
-  return Check<T>(params_, key, necessity, validator, ToIntegral<T>);
+  return Check<T>(paramsTooDeep_ ? nullptr : &params_, key, necessity, validator, ToIntegral<T>);
 }
 
 template VELT_CXX_API APIParameter<uint64_t> APIRequest::GetAndCheckIntegral<uint64_t>(
@@ -72,7 +98,7 @@ template VELT_CXX_API APIParameter<uint32_t> APIRequest::GetAndCheckIntegral<uin
 APIParameter<std::string> APIRequest::GetAndCheckString(const std::string& key,
                                                         PARAM_NECESSITY necessity,
                                                         Validator<std::string> validator) const {
-  return Check<std::string>(params_, key, necessity, validator,
+  return Check<std::string>(paramsTooDeep_ ? nullptr : &params_, key, necessity, validator,
                             [](const Json::Value& v, std::string* out) {
                               if (!v.isString()) return false;
                               *out = v.asString();
@@ -82,17 +108,18 @@ APIParameter<std::string> APIRequest::GetAndCheckString(const std::string& key,
 
 APIParameter<bool> APIRequest::GetAndCheckBool(const std::string& key, PARAM_NECESSITY necessity,
                                                Validator<bool> validator) const {
-  return Check<bool>(params_, key, necessity, validator, [](const Json::Value& v, bool* out) {
-    if (!v.isBool()) return false;
-    *out = v.asBool();
-    return true;
-  });
+  return Check<bool>(paramsTooDeep_ ? nullptr : &params_, key, necessity, validator,
+                     [](const Json::Value& v, bool* out) {
+                       if (!v.isBool()) return false;
+                       *out = v.asBool();
+                       return true;
+                     });
 }
 
 APIParameter<Json::Value> APIRequest::GetAndCheckObject(const std::string& key,
                                                         PARAM_NECESSITY necessity,
                                                         Validator<Json::Value> validator) const {
-  return Check<Json::Value>(params_, key, necessity, validator,
+  return Check<Json::Value>(paramsTooDeep_ ? nullptr : &params_, key, necessity, validator,
                             [](const Json::Value& v, Json::Value* out) {
                               if (!v.isObject()) return false;
                               *out = v;

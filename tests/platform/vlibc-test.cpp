@@ -1,12 +1,17 @@
 // Key/value files, processes, last error and fault switches.
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <velt/dev.h>
 #include <velt/vlibc.h>
 
+#include <chrono>
 #include <cstring>
 #include <filesystem>
+#include <functional>
+#include <future>
+#include <thread>
 #include <vector>
 
 #include "sandbox.h"
@@ -73,6 +78,63 @@ TEST_F(KeyValueTest, NewFileIs0644AndRewriteKeepsModeWithoutLeftovers) {
   ASSERT_TRUE(chmod(F(), 0600) == 0 && Set("a", "2") == 0 && stat(F(), &st) == 0);
   EXPECT_EQ(0600u, st.st_mode & 07777);
   EXPECT_EQ(1, std::distance(std::filesystem::directory_iterator(Path("/etc")), {}));
+}
+
+// Runs call on a thread of its own and returns its result, or -2 when it
+// has not returned within 10 s; release() must then make it return, so that
+// a call that blocks fails the suite instead of hanging it.
+int Bounded(const std::function<int()>& call, const std::function<void()>& release) {
+  std::packaged_task<int()> task(call);
+  std::future<int> result = task.get_future();
+  std::thread thread(std::move(task));
+  const bool done = result.wait_for(std::chrono::seconds(10)) == std::future_status::ready;
+  if (!done) release();
+  thread.join();
+  return done ? result.get() : -2;
+}
+
+TEST_F(KeyValueTest, OnlyRegularFilesUpToOneMebibyteAreRead) {
+  const std::string line = "a=\"1\"\n";
+  auto padded = [&](size_t size) { return line + std::string(size - line.size() - 1, '#') + "\n"; };
+  const char* file = F();
+  const struct {
+    const char* name;
+    std::function<void()> make;
+    bool readable;
+  } cases[] = {
+      {"regular", [&] { WriteFile(kFile, line); }, true},
+      {"exactly 1 MiB", [&] { WriteFile(kFile, padded(1 << 20)); }, true},
+      {"1 MiB and a byte", [&] { WriteFile(kFile, padded((1 << 20) + 1)); }, false},
+      {"fifo", [&] { ASSERT_EQ(0, mkfifo(file, 0600)); }, false},
+      {"link to /dev/zero", [&] { ASSERT_EQ(0, symlink("/dev/zero", file)); }, false},
+  };
+  // Lets a reader blocked on opening the FIFO go on.
+  auto release = [&] { close(open(file, O_WRONLY | O_NONBLOCK)); };
+  // The platform call's result, and its last error (kept per thread) in err.
+  int err = 0;
+  auto call = [&](const std::function<int()>& fn) {
+    return Bounded([&] { int rc = fn(); err = VLIBCErrGet(); return rc; }, release);
+  };
+  MakeDir("/etc");
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    unlink(file);
+    c.make();
+    struct stat before {};
+    ASSERT_EQ(0, lstat(file, &before));
+    char value[8] = {};
+    EXPECT_EQ(c.readable ? 2 : -1,
+              call([&] { return VLIBCFileGetKeyValue(file, "a", value, sizeof value, 0); }));
+    EXPECT_TRUE(c.readable || err == VLIBC_ERR_IO) << err;
+    EXPECT_EQ(c.readable ? 1 : -1, call([&] { return VLIBCFileCheckKeyValue(file, "a", "1", 0); }));
+    EXPECT_EQ(c.readable ? 0 : -1,
+              call([&] { return VLIBCFileSetKeyValue(file, "b", "2", kFormat); }));
+    EXPECT_TRUE(c.readable || err == VLIBC_ERR_IO) << err;
+    // A refused file is left as it was.
+    struct stat after {};
+    ASSERT_EQ(0, lstat(file, &after));
+    EXPECT_EQ(!c.readable, before.st_ino == after.st_ino && before.st_mode == after.st_mode);
+  }
 }
 
 using ProcessTest = plovo_test::SandboxTest;

@@ -69,4 +69,40 @@ TEST(APIRequestTest, AbsentParameterDependsOnNecessityAndValidatorJudgesTheRest)
   EXPECT_TRUE(refused.IsInvalid() && refused.IsSet() && refused.Get() == 0);
 }
 
+TEST(APIRequestTest, ParametersNestedTooDeeplyMakeEveryReadInvalid) {
+  const int bound = VELT::kMaxParamDepth;
+  // Parameters "s" and "o" where "o" holds objects or arrays down to the
+  // given depth, the parameter object counting as one.
+  auto params = [](int depth, bool arrays) {
+    const int inner = depth - 1;
+    const std::string open = arrays ? "[" : "{\"o\": ", close = arrays ? "]" : "}";
+    std::string o;
+    for (int i = 1; i < inner; ++i) o += open;
+    o += arrays ? "[]" : "{}";
+    for (int i = 1; i < inner; ++i) o += close;
+    return R"({"s": "x", "n": 1, "o": )" + o + "}";
+  };
+  const struct {
+    int depth;
+    bool arrays;
+    bool valid;
+  } cases[] = {
+      {bound - 1, false, true}, {bound, false, true},   {bound, true, true},
+      {bound + 1, false, false}, {bound + 1, true, false}, {3 * bound, true, false},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(std::to_string(c.depth) + (c.arrays ? " arrays" : " objects"));
+    VELT::APIRequest req = Request(params(c.depth, c.arrays));
+    auto s = req.GetAndCheckString("s", PARAM_REQUIRED, nullptr);
+    auto n = req.GetAndCheckIntegral<uint32_t>("n", PARAM_REQUIRED, nullptr);
+    auto o = req.GetAndCheckObject("o", PARAM_OPTIONAL, nullptr);
+    auto absent = req.GetAndCheckBool("absent", PARAM_OPTIONAL, nullptr);
+    EXPECT_EQ(c.valid, !s.IsInvalid() && s.Get() == "x");
+    EXPECT_EQ(c.valid, !n.IsInvalid() && n.Get() == 1);
+    EXPECT_EQ(c.valid && !c.arrays, !o.IsInvalid() && o.Get().isObject());
+    EXPECT_EQ(c.valid, !absent.IsInvalid());
+    EXPECT_EQ(c.valid, req.GetParams().isObject());
+  }
+}
+
 }  // namespace

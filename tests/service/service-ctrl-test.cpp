@@ -1,11 +1,18 @@
 #include "service/service-ctrl.h"
 
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 #include <syslog.h>
 #include <velt/dev.h>
 
+#include <chrono>
+#include <functional>
+#include <future>
 #include <string>
+#include <thread>
 
 #include "log-capture.h"
 #include "sandbox.h"
@@ -19,6 +26,10 @@ class ServiceStatusTest : public plovo_test::SandboxTest {
   void SetUp() override {
     SandboxTest::SetUp();
     MakeDir("/var/packages/Plovo/etc");
+  }
+  void TearDown() override {
+    SetServiceStatusLockWait(std::chrono::milliseconds(0));
+    SandboxTest::TearDown();
   }
   static constexpr const char* kStatus = "/var/packages/Plovo/etc/status";
 };
@@ -73,6 +84,70 @@ TEST_F(ServiceStatusTest, LockFileThatCannotBeCreatedFailsReadAndWrite) {
   EXPECT_EQ(SetServiceStatus(st), -1);
   EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to open plovo status lock file.")) << log.Dump();
   EXPECT_EQ(ReadFile(kStatus), "state=\"4\"\nerror=\"\"\n");
+}
+
+// Runs call on a thread of its own and returns its result, or -2 when it
+// has not returned within 10 s; release() must then make it return, so that
+// a call that blocks fails the suite instead of hanging it.
+int Bounded(const std::function<int()>& call, const std::function<void()>& release) {
+  std::packaged_task<int()> task(call);
+  std::future<int> result = task.get_future();
+  std::thread thread(std::move(task));
+  const bool done = result.wait_for(std::chrono::seconds(10)) == std::future_status::ready;
+  if (!done) release();
+  thread.join();
+  return done ? result.get() : -2;
+}
+
+TEST_F(ServiceStatusTest, StatusFileThatIsNotARegularFileFailsReadAndWrite) {
+  const std::string status = Path(kStatus);
+  const struct {
+    const char* name;
+    std::function<int()> make;
+  } cases[] = {
+      // A reader would wait for a writer.
+      {"fifo", [&] { return mkfifo(status.c_str(), 0600); }},
+      // A reader would never reach the end.
+      {"link to /dev/zero", [&] { return symlink("/dev/zero", status.c_str()); }},
+  };
+  // Lets a reader blocked on opening the FIFO go on.
+  auto release = [&] { close(open(status.c_str(), O_WRONLY | O_NONBLOCK)); };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    unlink(status.c_str());
+    ASSERT_EQ(c.make(), 0);
+    LogCapture log;
+    EXPECT_EQ(Bounded([] { ServiceStatus st; return GetServiceStatus(st); }, release), -1);
+    EXPECT_EQ(Bounded([] { ServiceStatus st; st.state = 4; return SetServiceStatus(st); }, release),
+              -1);
+    EXPECT_TRUE(log.Contains(LOG_ERR, "Plovo status file is not a regular file")) << log.Dump();
+    struct stat info {};
+    EXPECT_TRUE(lstat(status.c_str(), &info) == 0 && !S_ISREG(info.st_mode));
+  }
+}
+
+TEST_F(ServiceStatusTest, LockHeldElsewhereFailsAfterTheWait) {
+  WriteStatus(4, "");
+  // flock conflicts between open file descriptions, even in one process.
+  const int holder = open(Path("/var/packages/Plovo/etc/status.lock").c_str(),
+                          O_RDWR | O_CREAT | O_CLOEXEC, 0440);
+  ASSERT_GE(holder, 0);
+  ASSERT_EQ(flock(holder, LOCK_EX), 0);
+  SetServiceStatusLockWait(std::chrono::seconds(1));
+  LogCapture log;
+  auto release = [&] { flock(holder, LOCK_UN); };
+  EXPECT_EQ(Bounded([] { ServiceStatus st; return GetServiceStatus(st); }, release), -1);
+  EXPECT_EQ(Bounded([] { ServiceStatus st; st.state = 6; return SetServiceStatus(st); }, release),
+            -1);
+  EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to lock file.")) << log.Dump();
+  EXPECT_EQ(ReadFile(kStatus), "state=\"4\"\nerror=\"\"\n");
+
+  // Once the holder lets go, the same read succeeds.
+  flock(holder, LOCK_UN);
+  close(holder);
+  ServiceStatus st;
+  EXPECT_EQ(GetServiceStatus(st), 0);
+  EXPECT_EQ(st.state, 4);
 }
 
 TEST_F(ServiceStatusTest, LockFileIsCreatedReadOnly) {

@@ -59,6 +59,13 @@ class VELT_CXX_API APIParameter {
   T value_{};
 };
 
+/* The deepest nesting of objects and arrays a request's parameters may have,
+ * the parameter object itself counting as one. Deeper parameters are
+ * dropped when the request is built, and every parameter read is then
+ * invalid: a module copies parameter values, and jsoncpp copies and frees a
+ * value by recursion. */
+constexpr int kMaxParamDepth = 64;
+
 /* A request: API name, version, method name and the parameters, a JSON
  * object. */
 class VELT_CXX_API APIRequest {
@@ -71,6 +78,7 @@ class VELT_CXX_API APIRequest {
   const std::string& GetAPIName() const { return api_; }
   int GetAPIVersion() const { return version_; }
   std::string GetAPIMethod() const { return method_; }
+  /* Null when the parameters were nested too deeply. */
   const Json::Value& GetParams() const { return params_; }
 
   /* Typed parameter readers. Integral accepts uint64_t and uint32_t: a JSON
@@ -92,6 +100,7 @@ class VELT_CXX_API APIRequest {
   int version_;
   std::string method_;
   Json::Value params_;
+  bool paramsTooDeep_ = false;
 };
 
 extern template VELT_CXX_API APIParameter<uint64_t> APIRequest::GetAndCheckIntegral<uint64_t>(
