@@ -14,6 +14,7 @@
 #include <thread>
 #include <vector>
 
+#include "bounded.h"
 #include "sandbox.h"
 
 namespace {
@@ -80,18 +81,7 @@ TEST_F(KeyValueTest, NewFileIs0644AndRewriteKeepsModeWithoutLeftovers) {
   EXPECT_EQ(1, std::distance(std::filesystem::directory_iterator(Path("/etc")), {}));
 }
 
-// Runs call on a thread of its own and returns its result, or -2 when it
-// has not returned within 10 s; release() must then make it return, so that
-// a call that blocks fails the suite instead of hanging it.
-int Bounded(const std::function<int()>& call, const std::function<void()>& release) {
-  std::packaged_task<int()> task(call);
-  std::future<int> result = task.get_future();
-  std::thread thread(std::move(task));
-  const bool done = result.wait_for(std::chrono::seconds(10)) == std::future_status::ready;
-  if (!done) release();
-  thread.join();
-  return done ? result.get() : -2;
-}
+using plovo_test::Bounded;
 
 TEST_F(KeyValueTest, OnlyRegularFilesUpToOneMebibyteAreRead) {
   const std::string line = "a=\"1\"\n";

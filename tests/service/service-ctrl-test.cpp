@@ -14,6 +14,7 @@
 #include <string>
 #include <thread>
 
+#include "bounded.h"
 #include "log-capture.h"
 #include "sandbox.h"
 
@@ -86,18 +87,7 @@ TEST_F(ServiceStatusTest, LockFileThatCannotBeCreatedFailsReadAndWrite) {
   EXPECT_EQ(ReadFile(kStatus), "state=\"4\"\nerror=\"\"\n");
 }
 
-// Runs call on a thread of its own and returns its result, or -2 when it
-// has not returned within 10 s; release() must then make it return, so that
-// a call that blocks fails the suite instead of hanging it.
-int Bounded(const std::function<int()>& call, const std::function<void()>& release) {
-  std::packaged_task<int()> task(call);
-  std::future<int> result = task.get_future();
-  std::thread thread(std::move(task));
-  const bool done = result.wait_for(std::chrono::seconds(10)) == std::future_status::ready;
-  if (!done) release();
-  thread.join();
-  return done ? result.get() : -2;
-}
+using plovo_test::Bounded;
 
 TEST_F(ServiceStatusTest, StatusFileThatIsNotARegularFileFailsReadAndWrite) {
   const std::string status = Path(kStatus);

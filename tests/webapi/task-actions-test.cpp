@@ -148,6 +148,14 @@ TEST_F(TaskActionTest, CancelOfATaskWithNothingToStopSucceeds) {
   EXPECT_TRUE(Call("cancel", J(R"({"id": 3})")).IsSuccess());
   EXPECT_FALSE(log.Contains("Failed to send task command")) << log.Dump();
   EXPECT_EQ(Call("run", J(R"({"id": 3})")).GetErrorCode(), 401);
+
+  // A code is the daemon's word only in an answer that arrived whole.
+  const std::string code8 = std::string("\x42\x10\x00\x0a" "error_code" "\x01\x01\x08", 17);
+  const std::string code3 = std::string("\x42\x10\x00\x0a" "error_code" "\x01\x01\x03", 17);
+  daemon_->Answer(DaemonAnswer::Bytes(code8));
+  EXPECT_EQ(Call("cancel", J(R"({"id": 3})")).GetErrorCode(), 401);
+  daemon_->Answer(DaemonAnswer::Bytes(code3 + "\x77"));
+  EXPECT_EQ(Call("run", J(R"({"id": 3})")).GetErrorCode(), 401);
 }
 
 TEST_F(TaskActionTest, BadRequestsAreRefusedBeforeTheDaemonHearsOfThem) {
@@ -174,6 +182,17 @@ TEST_F(TaskActionTest, BadRequestsAreRefusedBeforeTheDaemonHearsOfThem) {
       {"create", R"({"task": {"type": "import_general", "source_path": "/usbshare1", "destination_path": "/photo/../etc"}})", 414},
       {"create", R"({"task": {"type": "export_general", "source_path": "/photo", "destination_path": "/usbshare1/c:"}})", 414},
       {"set_setting", R"({"id": 1, "task_setting": {"type": "import_general", "source_path": "/u/./a", "destination_path": "/p"}})", 414},
+      // A share name is one name: never a step out of the shares' folder.
+      {"create", R"({"task": {"type": "import_general", "source_path": "/usbshare1", "destination_path": "/../etc"}})", 414},
+      {"create", R"({"task": {"type": "export_general", "source_path": "/photo", "destination_path": "/./x"}})", 414},
+      {"set_setting", R"({"id": 1, "task_setting": {"type": "import_general", "source_path": "/u", "destination_path": "//etc"}})", 414},
+      {"set_setting", R"({"id": 1, "task_setting": {"type": "import_general", "source_path": "/u", "destination_path": "/.."}})", 414},
+      // A zero byte would end the string early on its way: what was checked
+      // would not be what is used.
+      {"set_setting", R"({"id": 1, "task_setting": {"type": "import_general", "source_path": "/u/a", "destination_path": "/photo/..\u0000"}})", 402},
+      {"create", R"({"task": {"type": "import_general", "name": "T\u0000", "source_path": "/usbshare1", "destination_path": "/photo"}})", 402},
+      {"delete", R"({"id": 1, "x\u0000y": true})", 402},
+      {"set_filter", R"({"id": 1, "task_filter": {"black_list": {"names": ["a", ["\u0000"]]}}})", 402},
   };
   for (const auto& c : cases) {
     VELT::APIResponse r = Call(c.method, J(c.params));
