@@ -1,9 +1,7 @@
 #include "ipc/plovo-command.h"
 
-#include "common/log.h"
+#include "common/usb-device.h"
 #include "common/utility.h"
-#include "common/velt-sdk-wrapper.h"
-#include "velt/storage.h"
 
 namespace Plovo {
 namespace {
@@ -56,51 +54,6 @@ void PutFilterFields(const FilterSetting& filter, PObject& request) {
   AppendJsonArrayToPObject(filter.custom_ext, "custom_ext", request);
 }
 
-// The storage service's device list, checked for its "devices" array.
-int GetAllUSBData(Json::Value& devices) {
-  Json::Value info;
-  if (VELT::QXS::STORAGE_WEBUTILS::Storage::GetUSBInfo(info) < 0) {
-    PLOVO_LIB_ERR("Failed to get USBInfo");
-  } else if (!info.isObject() || !info["devices"].isArray()) {
-    PLOVO_LIB_ERR("USBInfo is invalid (%s)", info.toStyledString().c_str());
-  } else {
-    devices.swap(info["devices"]);
-    return 0;
-  }
-  PLOVO_LIB_ERR("Failed to get all usb data");
-  return -1;
-}
-
-std::string StringMember(const Json::Value& object, const char* key) {
-  const Json::Value& v = object[key];
-  return v.isString() ? v.asString() : "";
-}
-
-// The producer and product of the device that lists a partition shared as
-// shareName; the first such device wins.
-int GetUSBProducerProduct(const std::string& shareName, std::string& producer,
-                          std::string& product) {
-  Json::Value devices;
-  if (GetAllUSBData(devices) < 0) return -1;
-  for (const Json::Value& device : devices) {
-    const Json::Value& partitions = device.isObject() ? device["partitions"] : Json::Value::nullSingleton();
-    if (!partitions.isArray()) {
-      PLOVO_LIB_DBG("USBData partitions is invalid (%s)", device.toStyledString().c_str());
-      continue;
-    }
-    for (const Json::Value& partition : partitions) {
-      if (partition.isObject() && partition["share_name"].isString() &&
-          partition["share_name"].asString() == shareName) {
-        producer = StringMember(device, "producer");
-        product = StringMember(device, "product");
-        return 0;
-      }
-    }
-  }
-  PLOVO_LIB_DBG("producer and product not found for share_name '%s'", shareName.c_str());
-  return -1;
-}
-
 }  // namespace
 
 void AppendJsonArrayToPObject(const Json::Value& array, const std::string& key, PObject& object) {
@@ -113,47 +66,13 @@ void AppendJsonArrayToPObject(const Json::Value& array, const std::string& key, 
 
 int CreateTaskCmd(const TaskSetting& task, const TriggerTimeSetting& trigger,
                   const FilterSetting& filter, PObject& request) {
-  const char* shareName = task.usb_share_name.c_str();
-  SDK::Share share;
-  if (share.open(task.usb_share_name) < 0) {
-    PLOVO_LIB_ERR("Failed to open share '%s'", shareName);
-    return -1;
-  }
-  if (!share.isMounted()) {
-    PLOVO_LIB_ERR("Share '%s' is not mounted", shareName);
-    return -1;
-  }
-  const std::string sharePath = share.getMountPoint();
-  share.close();
-
-  std::string devPath;
-  if (SDK::GetDevPath(sharePath, devPath) < 0) {
-    PLOVO_LIB_ERR("Failed to get dev_path for usb_share_path '%s'", sharePath.c_str());
-    return -1;
-  }
-  std::string uuid;
-  if (SDK::GetUUID(sharePath, devPath, uuid) < 0) {
-    PLOVO_LIB_ERR("Failed to get uuid for dev_path '%s'", devPath.c_str());
-    // The identity goes onto the device itself, so that the device is
-    // recognised by the same identity in any NAS it is plugged into.
-    const int made = SDK::GetOrCreateUUID(sharePath, devPath, uuid);
-    if (made < 0) {
-      PLOVO_LIB_ERR("Failed to write Plovo config '%s', uuid '%s'", sharePath.c_str(), uuid.c_str());
-      return -1;
-    }
-    if (made == 1) PLOVO_LIB_WARN("write uuid '%s' to config file", uuid.c_str());
-  }
-  std::string producer, product;
-  if (GetUSBProducerProduct(task.usb_share_name, producer, product) < 0) {
-    PLOVO_LIB_ERR("Failed to get usb info for usb_share_name '%s'", shareName);
-    return -1;
-  }
-
+  USBDevice device;
+  if (ResolveUSBDevice(task.usb_share_name, device) < 0) return -1;
   Begin("add_task", request);
-  request["uuid"] = uuid;
-  request["usb_share_path"] = sharePath;
-  request["producer"] = producer;
-  request["product"] = product;
+  request["uuid"] = device.uuid;
+  request["usb_share_path"] = device.share_path;
+  request["producer"] = device.producer;
+  request["product"] = device.product;
   PutTaskFields(task, request);
   request["copy_strategy"] = static_cast<int>(task.copy_strategy);
   PutTriggerFields(trigger, request);

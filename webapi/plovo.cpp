@@ -8,6 +8,7 @@
 #include "common/run-as.h"
 #include "ipc/pobject.h"
 #include "service/service-ctrl.h"
+#include "webapi/methods.h"
 
 void Process(VELT::APIRequest* request, VELT::APIResponse* response) {
   // Nothing may be thrown into the web server.
@@ -85,25 +86,12 @@ void PlovoHandle::HandleAction() {
     const char* method;
     void (PlovoHandle::*action)();
   };
-  // Same names, same order as the exported method table.
+#define PLOVO_ACTION_ROW(method, action) {method, &PlovoHandle::action},
   static const ActionRow kActions[] = {
-      {"list", &PlovoHandle::List},
-      {"create", &PlovoHandle::Create},
-      {"get", &PlovoHandle::Get},
-      {"get_filter", &PlovoHandle::GetFilter},
-      {"set_setting", &PlovoHandle::SetSetting},
-      {"set_trigger_time", &PlovoHandle::SetTriggerTime},
-      {"set_filter", &PlovoHandle::SetFilter},
-      {"delete", &PlovoHandle::Delete},
-      {"run", &PlovoHandle::Run},
-      {"cancel", &PlovoHandle::Cancel},
-      {"enable", &PlovoHandle::Enable},
-      {"disable", &PlovoHandle::Disable},
-      {"get_global_setting", &PlovoHandle::GetGlobalSetting},
-      {"set_global_setting", &PlovoHandle::SetGlobalSetting},
-      {"get_log_list", &PlovoHandle::GetLogList},
+      PLOVO_METHODS(PLOVO_ACTION_ROW)
       {nullptr, nullptr},
   };
+#undef PLOVO_ACTION_ROW
 
   const std::string method = request->GetAPIMethod();
   for (const ActionRow* row = kActions; row->action != nullptr; ++row) {

@@ -1,7 +1,6 @@
 // "delete", "run", "enable", "disable" and "cancel": one daemon command on
 // one task. Whether the task exists is the daemon's answer.
 #include "common/log.h"
-#include "ipc/daemon-ipc.h"
 #include "ipc/plovo-command.h"
 #include "webapi/plovo.h"
 
@@ -12,14 +11,14 @@ constexpr int32_t kNothingToCancel = 8;
 
 }  // namespace
 
-void PlovoHandle::SendTaskIdCmd(int (*build)(unsigned long, PObject&)) {
+void PlovoHandle::SendTaskIdCmd(int (*build)(unsigned long, PObject&), std::initializer_list<int32_t> okCodes) {
   const auto id = request->GetAndCheckIntegral<uint64_t>("id", VELT::PARAM_REQUIRED, nullptr);
   if (id.IsInvalid()) {
     response->SetError(402);
     return;
   }
   PObject command, reply;
-  if (!Forward(build(id.Get(), command), command, reply, "task")) return;
+  if (!Forward(build(id.Get(), command), command, reply, "task", okCodes)) return;
   response->SetSuccess();
 }
 
@@ -27,26 +26,5 @@ void PlovoHandle::Delete() { SendTaskIdCmd(Plovo::DeleteTaskCmd); }
 void PlovoHandle::Run() { SendTaskIdCmd(Plovo::StartTaskCmd); }
 void PlovoHandle::Enable() { SendTaskIdCmd(Plovo::EnableTaskCmd); }
 void PlovoHandle::Disable() { SendTaskIdCmd(Plovo::DisableTaskCmd); }
-
-void PlovoHandle::Cancel() {
-  const auto id = request->GetAndCheckIntegral<uint64_t>("id", VELT::PARAM_REQUIRED, nullptr);
-  if (id.IsInvalid()) {
-    response->SetError(402);
-    return;
-  }
-  PObject command, reply;
-  if (Plovo::StopTaskCmd(id.Get(), command) != 0) {
-    PLOVO_LOG(LOG_ERR, "Failed to get daemon command");
-    response->SetError(401);
-    return;
-  }
-  DaemonIPC daemon;
-  // Cancelling a task that is not running leaves it as the user wants it.
-  if (daemon.SendCommand(command, reply) < 0 &&
-      !(reply.hasMember("error_code") && reply["error_code"].asInt32() == kNothingToCancel)) {
-    PLOVO_LOG(LOG_ERR, "Failed to send task command, res=[%s]", DaemonIPC::LogText(reply).c_str());
-    response->SetError(GetErrorCodeFromResponse(reply));
-    return;
-  }
-  response->SetSuccess();
-}
+// Cancelling a task that is not running leaves it as the user wants it.
+void PlovoHandle::Cancel() { SendTaskIdCmd(Plovo::StopTaskCmd, {kNothingToCancel}); }

@@ -1,5 +1,5 @@
 // "list" and "get": the daemon's task maps as the web interface's task
-// records, and the enumeration strings they carry.
+// records.
 #include <velt/sched.h>
 
 #include <memory>
@@ -9,48 +9,12 @@
 #include "ipc/plovo-command.h"
 #include "webapi/plovo.h"
 
-const std::string PlovoHandle::TYPE_IMPORT = "import_general";
-const std::string PlovoHandle::TYPE_EXPORT = "export_general";
-const std::string PlovoHandle::TYPE_IMPORT_PHOTO = "import_photo";
-const std::string PlovoHandle::STRATEGY_VERSION = "versioning";
-const std::string PlovoHandle::STRATEGY_MIRROR = "mirror";
-const std::string PlovoHandle::STRATEGY_INCBKP = "incremental";
-const std::string PlovoHandle::CONFLICT_RENAME = "rename";
-const std::string PlovoHandle::CONFLICT_OVERWRITE = "overwrite";
-const std::string PlovoHandle::ROTATION_OLDEST_VERSION = "oldest_version";
-const std::string PlovoHandle::ROTATION_SMART_RECYCLE = "smart_recycle";
-
 namespace {
 
 // The default tasks of the front USB port and the SD card slot carry these
 // in place of a device identity.
 constexpr const char* kDefaultUsbUuid = "PLOVO_DEFAULT_USB_UUID";
 constexpr const char* kDefaultSdUuid = "PLOVO_DEFAULT_SD_UUID";
-
-// One enumeration's strings, indexed by value - 1.
-template <typename Enum, size_t N>
-Enum ToEnum(const std::string* const (&names)[N], const std::string& value) {
-  for (size_t i = 0; i < N; ++i) {
-    if (*names[i] == value) return static_cast<Enum>(i + 1);
-  }
-  return static_cast<Enum>(0);
-}
-
-template <size_t N>
-std::string ToString(const std::string* const (&names)[N], int32_t value) {
-  if (value < 1 || static_cast<size_t>(value) > N) return "";
-  return *names[value - 1];
-}
-
-const std::string* const kTypeNames[] = {&PlovoHandle::TYPE_IMPORT, &PlovoHandle::TYPE_EXPORT,
-                                         &PlovoHandle::TYPE_IMPORT_PHOTO};
-const std::string* const kStrategyNames[] = {&PlovoHandle::STRATEGY_VERSION,
-                                             &PlovoHandle::STRATEGY_MIRROR,
-                                             &PlovoHandle::STRATEGY_INCBKP};
-const std::string* const kConflictNames[] = {&PlovoHandle::CONFLICT_RENAME,
-                                             &PlovoHandle::CONFLICT_OVERWRITE};
-const std::string* const kRotationNames[] = {&PlovoHandle::ROTATION_OLDEST_VERSION,
-                                             &PlovoHandle::ROTATION_SMART_RECYCLE};
 
 // A device-side path as the web interface shows it: under the device's
 // share when mounted, under "[USB]" when not; the device root is the share
@@ -67,31 +31,6 @@ struct SchedTaskFree {
 };
 
 }  // namespace
-
-Registry::TASK_TYPE PlovoHandle::convertToEnumTT(const std::string& value) {
-  return ToEnum<Registry::TASK_TYPE>(kTypeNames, value);
-}
-std::string PlovoHandle::convertToStringTT(Registry::TASK_TYPE value) {
-  return ToString(kTypeNames, value);
-}
-Registry::COPY_STRATEGY PlovoHandle::convertToEnumCS(const std::string& value) {
-  return ToEnum<Registry::COPY_STRATEGY>(kStrategyNames, value);
-}
-std::string PlovoHandle::convertToStringCS(Registry::COPY_STRATEGY value) {
-  return ToString(kStrategyNames, value);
-}
-Registry::CONFLICT_POLICY PlovoHandle::convertToEnumCP(const std::string& value) {
-  return ToEnum<Registry::CONFLICT_POLICY>(kConflictNames, value);
-}
-std::string PlovoHandle::convertToStringCP(Registry::CONFLICT_POLICY value) {
-  return ToString(kConflictNames, value);
-}
-Registry::ROTATION_POLICY PlovoHandle::convertToEnumRP(const std::string& value) {
-  return ToEnum<Registry::ROTATION_POLICY>(kRotationNames, value);
-}
-std::string PlovoHandle::convertToStringRP(Registry::ROTATION_POLICY value) {
-  return ToString(kRotationNames, value);
-}
 
 Json::Value PlovoHandle::convertToJsonArray(const std::vector<PObject>& values) {
   Json::Value array(Json::arrayValue);
@@ -168,29 +107,6 @@ void PlovoHandle::setJsonTask(const PObject& task, Json::Value& out) {
   const int64_t scheduleId = task["schedule_id"].asInt64();
   out["schedule_id"] = Json::Int64(scheduleId);
   out["next_run_time"] = GetNextRunTime(scheduleId);
-}
-
-int PlovoHandle::SendToDaemon(const PObject& command, PObject& reply, const char* what,
-                              const char* file, int line) {
-  DaemonIPC daemon;
-  if (daemon.SendCommand(command, reply) >= 0) return 0;
-  Plovo::LogWrite(LOG_ERR, "%s:%d Failed to send %s command, res=[%s]", Plovo::LogBaseName(file),
-                  line, what, DaemonIPC::LogText(reply).c_str());
-  return GetErrorCodeFromResponse(reply);
-}
-
-bool PlovoHandle::Forward(int built, const PObject& command, PObject& reply, const char* what,
-                          const char* file, int line) {
-  if (built != 0) {
-    Plovo::LogWrite(LOG_ERR, "%s:%d Failed to get daemon command", Plovo::LogBaseName(file), line);
-    response->SetError(401);
-    return false;
-  }
-  if (int code = SendToDaemon(command, reply, what, file, line)) {
-    response->SetError(code);
-    return false;
-  }
-  return true;
 }
 
 void PlovoHandle::List() {

@@ -9,7 +9,6 @@
 #ifndef PLOVO_COMMON_VELT_SDK_WRAPPER_H
 #define PLOVO_COMMON_VELT_SDK_WRAPPER_H
 
-#include <chrono>
 #include <string>
 
 #include "velt/share.h"
@@ -51,22 +50,6 @@ int GetUUID(const std::string& path, const std::string& devPath, std::string& uu
 
 // A new random identity in the 36-character text form, lower case.
 std::string GenerateUUID();
-
-// How long GetOrCreateUUID waits for another holder of the device's
-// identity lock before it gives up: long enough for any real writer, short
-// enough that a stuck or hostile holder cannot hang a web request.
-constexpr std::chrono::milliseconds kUuidLockWait{5000};
-
-// For a device GetUUID found no identity for: under an exclusive lock on
-// "<path>/@eaDir/.VeltraPlovo.config.lock" (which works across processes
-// and threads alike), looks again and, when there is still none, stores a
-// new one in the device's configuration file, so that concurrent callers
-// all end with the same identity. 1 when this call stored uuid, 0 when it
-// found one stored meanwhile, -1 when the lock was not had within wait or
-// the identity could not be stored (logged here; uuid then holds the
-// identity that was not stored, or is empty when none was made).
-int GetOrCreateUUID(const std::string& path, const std::string& devPath, std::string& uuid,
-                    std::chrono::milliseconds wait = kUuidLockWait);
 
 }  // namespace SDK
 

@@ -16,6 +16,7 @@
 #include <json/value.h>
 
 #include <cstdint>
+#include <initializer_list>
 #include <string>
 #include <vector>
 
@@ -121,19 +122,23 @@ class PlovoHandle {
   void GetLogList();
 
   // Reads "id", builds the command with build and sends it; null data on
-  // success. Delete, Run, Enable and Disable are this with their builder.
-  void SendTaskIdCmd(int (*build)(unsigned long, PObject&));
-  // Sends command and reads the reply. On failure logs "Failed to send
-  // <what> command, res=[<reply>]" under the calling action's file and
-  // line, and returns the web error code for the reply; 0 on success.
+  // success. Delete, Run, Enable, Disable and Cancel are this with their
+  // builder; daemon codes in okCodes count as success.
+  void SendTaskIdCmd(int (*build)(unsigned long, PObject&), std::initializer_list<int32_t> okCodes = {});
+  // Sends command and reads the reply. A failure whose "error_code" is in
+  // okCodes counts as success. Otherwise logs "Failed to send <what>
+  // command, res=[<reply>]" under the calling action's file and line, and
+  // returns the web error code for the reply; 0 on success.
   static int SendToDaemon(const PObject& command, PObject& reply, const char* what,
+                          std::initializer_list<int32_t> okCodes = {},
                           const char* file = __builtin_FILE(), int line = __builtin_LINE());
   // The common road of a forwarding action: built is the builder's result.
   // A failed build answers 401 ("Failed to get daemon command"), a failed
   // exchange the reply's code; both are logged under the caller's line.
   // True when the reply is there to be read.
   bool Forward(int built, const PObject& command, PObject& reply, const char* what,
-               const char* file = __builtin_FILE(), int line = __builtin_LINE());
+               std::initializer_list<int32_t> okCodes = {}, const char* file = __builtin_FILE(),
+               int line = __builtin_LINE());
   // The next trigger time of an enabled schedule; "N/A" for the id -1, an
   // entry that cannot be loaded, or a disabled one.
   static std::string GetNextRunTime(int64_t scheduleId);

@@ -1,19 +1,11 @@
 #include "common/velt-sdk-wrapper.h"
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sys/file.h>
-#include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <cstdlib>
-#include <thread>
-#include <vector>
 
 #include "common/file-op.h"
-#include "log-capture.h"
 #include "sandbox.h"
 #include "velt/dev.h"
 #include "velt/storage.h"
@@ -93,72 +85,6 @@ TEST(NewIdentity, IsARandomLowerCaseUuidText) {
   ASSERT_EQ(a.size(), 36u);
   EXPECT_EQ(a.find_first_not_of("0123456789abcdef-"), std::string::npos) << a;
   EXPECT_EQ(a[14], '4') << a;  // version 4: random
-}
-
-// Concurrent creators on a device without identity must agree on one, the
-// one stored, and exactly one of them must report having stored it.
-TEST_F(PlatformShareTest, ConcurrentCreatorsAgreeOnTheStoredIdentity) {
-  constexpr int kThreads = 16;
-  const std::string root = Path("/usbshare1"), dev = Path("/dev/usb1");
-  for (int round = 0; round < 20; ++round) {
-    unlink(PlovoConfigPath(root).c_str());
-    std::atomic<bool> go{false};
-    std::vector<std::string> uuids(kThreads);
-    std::vector<int> results(kThreads);
-    std::vector<std::thread> threads;
-    for (int i = 0; i < kThreads; ++i) {
-      threads.emplace_back([&, i] {
-        while (!go) std::this_thread::yield();
-        results[i] = SDK::GetOrCreateUUID(root, dev, uuids[i]);
-      });
-    }
-    go = true;
-    for (std::thread& t : threads) t.join();
-
-    std::string stored;
-    ASSERT_EQ(ReadPlovoConfig(root, "uuid", stored), 1) << "round " << round;
-    ASSERT_EQ(stored.size(), 36u);
-    int writers = 0;
-    for (int i = 0; i < kThreads; ++i) {
-      ASSERT_GE(results[i], 0) << "round " << round;
-      writers += results[i];
-      ASSERT_EQ(uuids[i], stored) << "round " << round << ", thread " << i;
-    }
-    ASSERT_EQ(writers, 1) << "round " << round;
-  }
-}
-
-TEST_F(PlatformShareTest, CreationGivesUpOnALockHeldElsewhereAndLeavesAStoredIdentityAlone) {
-  const std::string root = Path("/usbshare1"), dev = Path("/dev/usb1");
-  const std::string config = PlovoConfigPath(root);
-  MakeDir("/usbshare1/@eaDir");
-  const int held = open((config + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
-  ASSERT_GE(held, 0);
-  ASSERT_EQ(flock(held, LOCK_EX), 0);
-  {
-    plovo_test::LogCapture log;
-    std::string uuid = "left over";
-    EXPECT_EQ(SDK::GetOrCreateUUID(root, dev, uuid, std::chrono::milliseconds(50)), -1);
-    EXPECT_EQ(uuid, "");
-    EXPECT_TRUE(log.Contains(LOG_ERR, "still held after 50 ms")) << log.Dump();
-    EXPECT_FALSE(Exists("/usbshare1/@eaDir/.VeltraPlovo.config"));
-  }
-  close(held);
-
-  std::string uuid;
-  ASSERT_EQ(SDK::GetOrCreateUUID(root, dev, uuid), 1);
-  std::string stored;
-  ASSERT_EQ(ReadPlovoConfig(root, "uuid", stored), 1);
-  EXPECT_EQ(uuid, stored);
-
-  // A stored identity is returned as it is: the file is not even replaced.
-  struct stat before, after;
-  ASSERT_EQ(stat(config.c_str(), &before), 0);
-  std::string again;
-  EXPECT_EQ(SDK::GetOrCreateUUID(root, dev, again), 0);
-  EXPECT_EQ(again, stored);
-  ASSERT_EQ(stat(config.c_str(), &after), 0);
-  EXPECT_EQ(after.st_ino, before.st_ino);
 }
 
 TEST_F(PlatformShareTest, TheStorageServiceAnswersTheDeclaredDevices) {
