@@ -35,3 +35,13 @@ bool PlovoHandle::Forward(int built, const PObject& command, PObject& reply, con
   }
   return true;
 }
+
+bool PlovoHandle::ReadTaskId(uint64_t& id) {
+  const auto param = request->GetAndCheckIntegral<uint64_t>("id", VELT::PARAM_REQUIRED, nullptr);
+  if (param.IsInvalid()) {
+    response->SetError(402);
+    return false;
+  }
+  id = param.Get();
+  return true;
+}

@@ -12,13 +12,10 @@ constexpr int32_t kNothingToCancel = 8;
 }  // namespace
 
 void PlovoHandle::SendTaskIdCmd(int (*build)(unsigned long, PObject&), std::initializer_list<int32_t> okCodes) {
-  const auto id = request->GetAndCheckIntegral<uint64_t>("id", VELT::PARAM_REQUIRED, nullptr);
-  if (id.IsInvalid()) {
-    response->SetError(402);
-    return;
-  }
+  uint64_t id = 0;
+  if (!ReadTaskId(id)) return;
   PObject command, reply;
-  if (!Forward(build(id.Get(), command), command, reply, "task", okCodes)) return;
+  if (!Forward(build(id, command), command, reply, "task", okCodes)) return;
   response->SetSuccess();
 }
 

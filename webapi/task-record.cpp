@@ -124,13 +124,10 @@ void PlovoHandle::List() {
 }
 
 void PlovoHandle::Get() {
-  const auto id = request->GetAndCheckIntegral<uint64_t>("id", VELT::PARAM_REQUIRED, nullptr);
-  if (id.IsInvalid()) {
-    response->SetError(402);
-    return;
-  }
+  uint64_t id = 0;
+  if (!ReadTaskId(id)) return;
   PObject command, reply;
-  if (!Forward(Plovo::GetTaskSettingCmd(id.Get(), command), command, reply, "GetSetting")) return;
+  if (!Forward(Plovo::GetTaskSettingCmd(id, command), command, reply, "GetSetting")) return;
   Json::Value data(Json::objectValue);
   setJsonTask(reply, data["task"]);
   response->SetSuccess(data);

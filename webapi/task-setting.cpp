@@ -266,13 +266,10 @@ void PlovoHandle::SetFilter() {
 }
 
 void PlovoHandle::GetFilter() {
-  const auto id = request->GetAndCheckIntegral<uint64_t>("id", VELT::PARAM_REQUIRED, nullptr);
-  if (id.IsInvalid()) {
-    response->SetError(402);
-    return;
-  }
+  uint64_t id = 0;
+  if (!ReadTaskId(id)) return;
   PObject command, reply;
-  if (!Forward(Plovo::GetFilterSettingCmd(id.Get(), command), command, reply, "GetFilter")) return;
+  if (!Forward(Plovo::GetFilterSettingCmd(id, command), command, reply, "GetFilter")) return;
   Json::Value filter(Json::objectValue);
   filter["white_list"]["extensions"] = convertToJsonArray(reply["white_ext"].asArray());
   filter["white_list"]["names"] = convertToJsonArray(reply["white_name"].asArray());

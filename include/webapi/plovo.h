@@ -121,6 +121,9 @@ class PlovoHandle {
   void SetGlobalSetting();
   void GetLogList();
 
+  // Reads the request's task "id"; false, after answering 402, when it is
+  // missing or not an unsigned integer.
+  bool ReadTaskId(uint64_t& id);
   // Reads "id", builds the command with build and sends it; null data on
   // success. Delete, Run, Enable, Disable and Cancel are this with their
   // builder; daemon codes in okCodes count as success.

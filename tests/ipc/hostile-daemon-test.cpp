@@ -1,7 +1,6 @@
 // DaemonIPC against a daemon that does not keep to the protocol: what such
 // a peer may cost the web server that runs the module is an error code,
 // bounded in time and memory, and nothing on disk.
-#include <dirent.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/socket.h>
@@ -11,6 +10,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <filesystem>
 #include <functional>
 #include <future>
 #include <set>
@@ -126,10 +126,7 @@ class HostileDaemonTest : public plovo_test::SandboxTest {
 
 std::set<std::string> Entries(const std::string& dir) {
   std::set<std::string> names;
-  if (DIR* d = opendir(dir.c_str())) {
-    while (dirent* e = readdir(d)) names.insert(e->d_name);
-    closedir(d);
-  }
+  for (const auto& entry : std::filesystem::directory_iterator(dir)) names.insert(entry.path().filename());
   return names;
 }
 
