@@ -12,21 +12,13 @@
 #include "common/paths.h"
 
 namespace plovo_bench {
-namespace {
-
-sockaddr_un SocketAddress(const std::string& path) {
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  std::strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
-  return addr;
-}
-
-}  // namespace
 
 int ConnectTo(const std::string& path) {
   int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
   if (fd < 0) return -1;
-  sockaddr_un addr = SocketAddress(path);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
   if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
     close(fd);
     return -1;
@@ -81,84 +73,31 @@ bool SameValue(const PObject& a, const PObject& b) {
   return false;
 }
 
-void Server::Stop() {
-  if (!thread_.joinable()) return;
-  stop_ = true;
-  int fd = ConnectTo(path_);
-  if (fd >= 0) close(fd);
-  thread_.join();
-}
-
-void Server::Run() {
-  thread_ = std::thread([this] {
-    for (;;) {
-      int fd = Accept();
-      if (stop_) {
-        if (fd >= 0) close(fd);
-        return;
-      }
-      if (fd >= 0) Serve(fd);
-    }
-  });
-}
-
 RawServer::RawServer(std::string request, std::string reply)
-    : request_(std::move(request)), reply_(std::move(reply)) {}
-
-RawServer::~RawServer() {
-  Stop();
-  if (fd_ >= 0) close(fd_);
-}
+    : request_(std::move(request)),
+      reply_(std::move(reply)),
+      server_([this](CommandServer::Connection& connection) { Serve(connection); }) {}
 
 bool RawServer::Start() {
-  if (request_.size() > kRawMessageLimit) return false;
-  path_ = Plovo::Path::DaemonSocket();
-  unlink(path_.c_str());
-  fd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un addr = SocketAddress(path_);
-  if (fd_ < 0 || bind(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0 || listen(fd_, 8) != 0) {
-    return false;
-  }
-  Run();
-  return true;
+  return request_.size() <= kRawMessageLimit && server_.Start(Plovo::Path::DaemonSocket()) == 0;
 }
 
-int RawServer::Accept() { return accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC); }
-
-void RawServer::Serve(int fd) {
+void RawServer::Serve(CommandServer::Connection& connection) {
   char request[kRawMessageLimit];
-  if (RecvAll(fd, request, request_.size()) && std::memcmp(request, request_.data(), request_.size()) == 0) {
-    SendAll(fd, reply_.data(), reply_.size());
+  if (RecvAll(connection.fd(), request, request_.size()) &&
+      std::memcmp(request, request_.data(), request_.size()) == 0) {
+    SendAll(connection.fd(), reply_.data(), reply_.size());
   }
-  close(fd);
 }
 
 ListenerServer::ListenerServer(PObject expected, PObject reply)
-    : expected_(std::move(expected)), reply_(std::move(reply)) {
+    : expected_(std::move(expected)),
+      reply_(std::move(reply)),
+      server_({}, [this](const PObject& request) { return SameValue(request, expected_) ? reply_ : refusal_; }) {
   refusal_["error"] = "unexpected request";
 }
 
-ListenerServer::~ListenerServer() { Stop(); }
-
-bool ListenerServer::Start() {
-  path_ = Plovo::Path::DaemonSocket();
-  if (listener_.prepare(path_) != 0) return false;
-  Run();
-  return true;
-}
-
-int ListenerServer::Accept() { return listener_.accept(); }
-
-void ListenerServer::Serve(int fd) {
-  IPCSender peer;
-  if (peer.assign(fd) != 0) {
-    close(fd);
-    return;
-  }
-  PObject request;
-  if (peer.recv(request) != 0) return;
-  peer.send(SameValue(request, expected_) ? reply_ : refusal_);
-}
+bool ListenerServer::Start() { return server_.Start(Plovo::Path::DaemonSocket()) == 0; }
 
 PObject AckReply() {
   PObject reply;

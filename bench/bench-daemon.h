@@ -2,22 +2,21 @@
 // commands: server threads on the sandbox's daemon socket, and the raw
 // client round trip they are measured against.
 //
-// Two servers answer one command per connection. RawServer is nothing but
-// system calls (accept, receive the expected bytes, send the answer's
-// bytes, close); ListenerServer is the daemon's side as the library's own
-// endpoints make it (IPCListener, IPCSender, a decoded request and an
-// encoded answer). Each checks what it received, so that a benchmark
-// measuring a wrong request fails instead of reporting a figure.
+// Two servers answer one command per connection, both CommandServers on
+// the sandbox's daemon socket, so that they accept alike. RawServer's
+// connections are nothing but system calls (receive the expected bytes,
+// send the answer's bytes); ListenerServer answers as the library's daemon
+// side does (a decoded request and an encoded answer). Each checks what it
+// received, so that a benchmark measuring a wrong request fails instead of
+// reporting a figure.
 #ifndef PLOVO_BENCH_BENCH_DAEMON_H
 #define PLOVO_BENCH_BENCH_DAEMON_H
 
-#include <atomic>
 #include <cstddef>
 #include <string>
-#include <thread>
 
+#include "ipc/command-server.h"
 #include "ipc/pobject.h"
-#include "ipc/simple-ipc.h"
 
 namespace plovo_bench {
 
@@ -49,69 +48,36 @@ bool RawRoundTrip(const std::string& path, const std::string& request, const std
 // key by key and arrays element by element.
 bool SameValue(const PObject& a, const PObject& b);
 
-// A server thread on the daemon socket. Serve handles one accepted
-// connection and closes it. Stop wakes the blocked accept with a
-// connection of its own; derived classes call it in their destructors,
-// before their own members go.
-class Server {
- public:
-  Server() = default;
-  virtual ~Server() = default;
-  Server(const Server&) = delete;
-  Server& operator=(const Server&) = delete;
-
-  void Stop();
-
- protected:
-  // Starts the thread; path_ must already be set.
-  void Run();
-  // The descriptor of the next connection, negative on failure.
-  virtual int Accept() = 0;
-  virtual void Serve(int fd) = 0;
-
-  std::string path_;
-
- private:
-  std::atomic<bool> stop_{false};
-  std::thread thread_;
-};
-
 // Answers the bytes reply to a connection that sends exactly the bytes
 // request; a wrong request gets no answer, which fails the client.
-class RawServer : public Server {
+class RawServer {
  public:
   RawServer(std::string request, std::string reply);
-  ~RawServer() override;
-  // Binds and listens on the daemon socket and starts the thread.
+  // Listens on the daemon socket and starts serving.
   bool Start();
 
  private:
-  int Accept() override;
-  void Serve(int fd) override;
+  void Serve(CommandServer::Connection& connection);
 
   std::string request_;
   std::string reply_;
-  int fd_ = -1;
+  CommandServer server_;  // last: stops before what it serves with goes
 };
 
 // Answers reply to a request equal to expected (SameValue), and
 // {"error": "unexpected request"} to any other, which makes
 // DaemonIPC::SendCommand fail.
-class ListenerServer : public Server {
+class ListenerServer {
  public:
   ListenerServer(PObject expected, PObject reply);
-  ~ListenerServer() override;
-  // Prepares the listener on the daemon socket and starts the thread.
+  // Listens on the daemon socket and starts serving.
   bool Start();
 
  private:
-  int Accept() override;
-  void Serve(int fd) override;
-
   PObject expected_;
   PObject reply_;
   PObject refusal_;
-  IPCListener listener_;
+  CommandServer server_;  // last: stops before what it serves with goes
 };
 
 // The daemon's answer to a command that succeeded: {"ack": "ok"}.

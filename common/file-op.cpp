@@ -17,7 +17,9 @@
 #include <string>
 #include <vector>
 
+#include "common/error-text.h"
 #include "common/log.h"
+#include "common/unique-fd.h"
 
 namespace {
 
@@ -26,20 +28,6 @@ constexpr size_t kCopyBufferSize = 33554432;  // 32 MiB
 // how much, so this only bounds one call.
 constexpr size_t kKernelChunk = size_t{1} << 30;
 constexpr const char* kConfigName = ".VeltraPlovo.config";
-
-// strerror may share one buffer between threads on some C libraries. Which
-// strerror_r the headers declare (GNU: returns the text, XSI: returns 0)
-// depends on feature macros; the overloads accept either.
-[[maybe_unused]] const char* PickErrText(int result, const char* buffer) {
-  return result == 0 ? buffer : "Unknown error";
-}
-[[maybe_unused]] const char* PickErrText(const char* result, const char*) { return result; }
-
-struct ErrText {
-  explicit ErrText(int err) : text(PickErrText(strerror_r(err, buffer, sizeof buffer), buffer)) {}
-  char buffer[128];
-  const char* text;
-};
 
 std::string FSBaseName(const std::string& path) {
   size_t end = path.find_last_not_of('/');
@@ -133,22 +121,6 @@ struct FreeDeleter {
   void operator()(char* p) const { std::free(p); }
 };
 
-// A descriptor closed when the owner goes, unless released first.
-struct Fd {
-  explicit Fd(int n) : fd(n) {}
-  ~Fd() {
-    if (fd >= 0) close(fd);
-  }
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  int release() {
-    int n = fd;
-    fd = -1;
-    return n;
-  }
-  int fd;
-};
-
 // The copy through one 32 MiB buffer. 0, -1 or -2 (destination full).
 int CopyWithBuffer(int in, int out) {
   std::unique_ptr<char, FreeDeleter> owned(static_cast<char*>(std::malloc(kCopyBufferSize)));
@@ -156,7 +128,7 @@ int CopyWithBuffer(int in, int out) {
   if (!buffer) {
     int err = errno;
     PLOVO_LIB_ERR("FSCopy: malloc(%d): %s (%d)", static_cast<int>(kCopyBufferSize),
-                  ErrText(err).text, err);
+                  Plovo::ErrorText(err).c_str(), err);
     return -1;
   }
   int result = 0;
@@ -168,7 +140,7 @@ int CopyWithBuffer(int in, int out) {
     if (n == 0) break;
     if (n < 0) {
       int err = errno;
-      PLOVO_LIB_ERR("CopyFile: read: %s (%d)", ErrText(err).text, err);
+      PLOVO_LIB_ERR("CopyFile: read: %s (%d)", Plovo::ErrorText(err).c_str(), err);
       result = -1;
       break;
     }
@@ -181,7 +153,7 @@ int CopyWithBuffer(int in, int out) {
       // A write that takes nothing leaves errno untouched; a device that
       // accepts no more bytes is out of room.
       int err = w == 0 ? ENOSPC : errno;
-      PLOVO_LIB_ERR("CopyFile: write: %s (%d)", ErrText(err).text, err);
+      PLOVO_LIB_ERR("CopyFile: write: %s (%d)", Plovo::ErrorText(err).c_str(), err);
       result = err == ENOSPC ? -2 : -1;
     }
     if (result != 0) break;
@@ -213,7 +185,8 @@ int GetFileInfo(const std::string& path, LocalFileInfo& info) {
   if (lstat(path.c_str(), &st) != 0) {
     int err = errno;
     if (err != ENOENT && err != ENOTDIR) {
-      PLOVO_LIB_ERR("GetFileInfo: lstat(%s): %s (%d)", path.c_str(), ErrText(err).text, err);
+      PLOVO_LIB_ERR("GetFileInfo: lstat(%s): %s (%d)",
+                    path.c_str(), Plovo::ErrorText(err).c_str(), err);
       return -1;
     }
     // A missing path is an answer, not a failure: callers ask in order to
@@ -251,7 +224,7 @@ int FSChown(const std::string& path, unsigned uid, unsigned gid) {
   if (chown(path.c_str(), static_cast<uid_t>(uid), static_cast<gid_t>(gid)) != 0) {
     int err = errno;
     PLOVO_LIB_ERR("FSChown: chown(%s, %d, %d): %s (%d)", path.c_str(), static_cast<int>(uid),
-                  static_cast<int>(gid), ErrText(err).text, err);
+                  static_cast<int>(gid), Plovo::ErrorText(err).c_str(), err);
     return -1;
   }
   return 0;
@@ -269,7 +242,8 @@ int FSMKDirP(const std::string& path, unsigned uid, unsigned gid) {
         FSChown(prefix, uid, gid);
       } else if (err != EEXIST || !IsFolder(prefix)) {
         if (err == EEXIST) err = ENOTDIR;
-        PLOVO_LIB_ERR("FSMKDirP: mkdir(%s): %s (%d)", prefix.c_str(), ErrText(err).text, err);
+        PLOVO_LIB_ERR("FSMKDirP: mkdir(%s): %s (%d)",
+                      prefix.c_str(), Plovo::ErrorText(err).c_str(), err);
         return -1;
       }
     }
@@ -291,7 +265,8 @@ int FSMKDir(const std::string& path, bool recursive, unsigned uid, unsigned gid)
         // Another caller made it since the look above: it is there, and
         // its owner is that caller's to set.
         if (err == EEXIST && IsFolder(path)) return 0;
-        PLOVO_LIB_ERR("FSMKDir: mkdir(%s): %s (%d)", path.c_str(), ErrText(err).text, err);
+        PLOVO_LIB_ERR("FSMKDir: mkdir(%s): %s (%d)",
+                      path.c_str(), Plovo::ErrorText(err).c_str(), err);
       }
       return -2;
     }
@@ -308,48 +283,54 @@ int FSMKDir(const std::string& path, bool recursive, unsigned uid, unsigned gid)
 // fails (a destination that is not a regular file, such as a device, goes
 // to the buffer at once).
 int FSCopy(const std::string& source, const std::string& destination, bool removeSource) {
-  Fd in(open(source.c_str(), O_RDONLY | O_CLOEXEC));
-  if (in.fd < 0) {
+  Plovo::UniqueFd in(open(source.c_str(), O_RDONLY | O_CLOEXEC));
+  if (!in) {
     int err = errno;
-    PLOVO_LIB_ERR("CopyFile: open(%s): %s (%d)", source.c_str(), ErrText(err).text, err);
+    PLOVO_LIB_ERR("CopyFile: open(%s): %s (%d)",
+                  source.c_str(), Plovo::ErrorText(err).c_str(), err);
     return -1;
   }
   // Opening a file onto itself would truncate it before the first byte is
   // read; refuse before anything is lost.
   struct stat inStat, outStat;
-  bool haveIn = fstat(in.fd, &inStat) == 0;
+  bool haveIn = fstat(in.get(), &inStat) == 0;
   if (haveIn && stat(destination.c_str(), &outStat) == 0 && inStat.st_dev == outStat.st_dev &&
       inStat.st_ino == outStat.st_ino) {
     PLOVO_LIB_ERR("FSCopy: '%s' and '%s' are the same file", source.c_str(), destination.c_str());
     return -1;
   }
-  int out = open(destination.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666);
-  if (out < 0) {
+  Plovo::UniqueFd out(open(destination.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666));
+  if (!out) {
     int err = errno;
-    PLOVO_LIB_ERR("CopyFile: open(%s): %s (%d)", destination.c_str(), ErrText(err).text, err);
+    PLOVO_LIB_ERR("CopyFile: open(%s): %s (%d)",
+                  destination.c_str(), Plovo::ErrorText(err).c_str(), err);
     return -1;
   }
-  bool regularOut = fstat(out, &outStat) == 0 && S_ISREG(outStat.st_mode);
+  bool regularOut = fstat(out.get(), &outStat) == 0 && S_ISREG(outStat.st_mode);
   bool kernel = haveIn && S_ISREG(inStat.st_mode) && regularOut;
-  int result = kernel && CopyInKernel(in.fd, out) ? 0 : CopyWithBuffer(in.fd, out);
-  close(in.release());
+  int result =
+      kernel && CopyInKernel(in.get(), out.get()) ? 0 : CopyWithBuffer(in.get(), out.get());
+  in.reset();
 
   // A file system that allocates at write-back may find the disk full only
   // now; for a move the source must not go while the copy is in doubt.
   // Devices and pipes have nothing to flush and refuse fsync.
-  if (fsync(out) != 0 && regularOut && result == 0) {
+  if (fsync(out.get()) != 0 && regularOut && result == 0) {
     int err = errno;
-    PLOVO_LIB_ERR("CopyFile: fsync: %s (%d)", ErrText(err).text, err);
+    PLOVO_LIB_ERR("CopyFile: fsync: %s (%d)", Plovo::ErrorText(err).c_str(), err);
     result = err == ENOSPC ? -2 : -1;
   }
-  if (close(out) != 0 && regularOut && result == 0 && errno != EINTR) {
+  // The last write may fail only at close, so that close is checked here
+  // rather than left to the owner.
+  if (close(out.release()) != 0 && regularOut && result == 0 && errno != EINTR) {
     int err = errno;
-    PLOVO_LIB_ERR("CopyFile: close: %s (%d)", ErrText(err).text, err);
+    PLOVO_LIB_ERR("CopyFile: close: %s (%d)", Plovo::ErrorText(err).c_str(), err);
     result = err == ENOSPC ? -2 : -1;
   }
   if (result == 0 && removeSource && remove(source.c_str()) != 0) {
     int err = errno;
-    PLOVO_LIB_ERR("FSCopy: remove(%s): %s (%d)", source.c_str(), ErrText(err).text, err);
+    PLOVO_LIB_ERR("FSCopy: remove(%s): %s (%d)",
+                  source.c_str(), Plovo::ErrorText(err).c_str(), err);
     result = -1;
   }
   return result;
@@ -389,7 +370,8 @@ int FSRemove(const std::string& path, bool /*flag*/) {
   }
   if (VELTEARemove(path.c_str(), -1, 0) != 0) {
     int err = errno;
-    PLOVO_LIB_ERR("Failed to remove ea '%s', [%d, %s]", path.c_str(), err, ErrText(err).text);
+    PLOVO_LIB_ERR("Failed to remove ea '%s', [%d, %s]",
+                  path.c_str(), err, Plovo::ErrorText(err).c_str());
     return -3;
   }
   return 0;
@@ -403,7 +385,7 @@ int FSRename(const std::string& source, const std::string& destination) {
   int err = errno;
   if (err != EXDEV) {
     PLOVO_LIB_ERR("FSRename: rename(%s, %s): %s (%d)", source.c_str(), destination.c_str(),
-                  ErrText(err).text, err);
+                  Plovo::ErrorText(err).c_str(), err);
     return err == ENAMETOOLONG ? -100 : -3;
   }
 
@@ -430,7 +412,8 @@ int FSRename(const std::string& source, const std::string& destination) {
   }
   if (rmdir(source.c_str()) != 0) {
     err = errno;
-    PLOVO_LIB_ERR("FSRename: rmdir(%s): %s (%d)", source.c_str(), ErrText(err).text, err);
+    PLOVO_LIB_ERR("FSRename: rmdir(%s): %s (%d)",
+                  source.c_str(), Plovo::ErrorText(err).c_str(), err);
     return -3;
   }
   return 0;

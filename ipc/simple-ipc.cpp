@@ -10,14 +10,18 @@
 #include <cerrno>
 #include <cstring>
 
+#include "common/error-text.h"
 #include "common/log.h"
+#include "common/unique-fd.h"
 #include "ipc/stream.h"
 
 namespace {
 
 constexpr int kBacklog = 8;
 
-void LogSysError(const char* call) { PLOVO_LIB_ERR("%s: %s (%d)", call, strerror(errno), errno); }
+void LogSysError(const char* call) {
+  PLOVO_LIB_ERR("%s: %s (%d)", call, Plovo::ErrorText(errno).c_str(), errno);
+}
 
 sockaddr_in Loopback(int port) {
   sockaddr_in addr{};
@@ -31,23 +35,19 @@ sockaddr_in Loopback(int port) {
 // bound, or -1. Returns the descriptor or -1.
 template <typename BindTo>
 int ListenLoopback(BindTo bindTo) {
-  int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
-  if (fd < 0) {
+  Plovo::UniqueFd fd(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP));
+  if (!fd) {
     LogSysError("socket");
     return -1;
   }
-  int port = bindTo(fd);
-  if (port < 0) {
-    close(fd);
-    return -1;
-  }
-  if (listen(fd, kBacklog) != 0) {
+  int port = bindTo(fd.get());
+  if (port < 0) return -1;
+  if (listen(fd.get(), kBacklog) != 0) {
     LogSysError("listen");
-    close(fd);
     return -1;
   }
   PLOVO_LIB_INFO("listening on port %d", port);
-  return fd;
+  return fd.release();
 }
 
 }  // namespace
@@ -170,30 +170,28 @@ int IPCListener::OpenDomainSocket(const std::string& path) {
   addr.sun_family = AF_UNIX;
   if (path.size() >= sizeof(addr.sun_path)) {
     // A cut path would bind somewhere else than the clients look.
-    PLOVO_LIB_ERR("bind: %s (%d)", strerror(ENAMETOOLONG), ENAMETOOLONG);
+    PLOVO_LIB_ERR("bind: %s (%d)", Plovo::ErrorText(ENAMETOOLONG).c_str(), ENAMETOOLONG);
     return -1;
   }
   memcpy(addr.sun_path, path.c_str(), path.size() + 1);
-  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (fd < 0) {
-    PLOVO_LIB_ERR("socket: %s (%d)", strerror(errno), errno);
+  Plovo::UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  if (!fd) {
+    PLOVO_LIB_ERR("socket: %s (%d)", Plovo::ErrorText(errno).c_str(), errno);
     return -1;
   }
   unlink(path.c_str());
   int on = 1;
-  setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &on, sizeof(on));
-  if (bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
-    PLOVO_LIB_ERR("bind: %s (%d)", strerror(errno), errno);
-    ::close(fd);
+  setsockopt(fd.get(), SOL_SOCKET, SO_REUSEADDR, &on, sizeof(on));
+  if (bind(fd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
+    PLOVO_LIB_ERR("bind: %s (%d)", Plovo::ErrorText(errno).c_str(), errno);
     return -1;
   }
-  if (listen(fd, kBacklog) != 0) {
-    PLOVO_LIB_ERR("listen: %s (%d)", strerror(errno), errno);
-    ::close(fd);
+  if (listen(fd.get(), kBacklog) != 0) {
+    PLOVO_LIB_ERR("listen: %s (%d)", Plovo::ErrorText(errno).c_str(), errno);
     return -1;
   }
   PLOVO_LIB_INFO("listening on domain socket '%s'", path.c_str());
-  return fd;
+  return fd.release();
 }
 
 void IPCListener::CloseSocket(int fd) {
@@ -205,7 +203,7 @@ void IPCListener::CloseDomainSocket(int fd) {
   sockaddr_un addr{};
   socklen_t length = sizeof(addr);
   if (getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &length) != 0) {
-    PLOVO_LIB_ERR("getsockname: %s (%d).", strerror(errno), errno);
+    PLOVO_LIB_ERR("getsockname: %s (%d).", Plovo::ErrorText(errno).c_str(), errno);
   } else if (addr.sun_path[0] != '\0') {
     unlink(addr.sun_path);
   }

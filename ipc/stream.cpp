@@ -9,6 +9,7 @@
 #include <cstring>
 #include <memory>
 
+#include "common/error-text.h"
 #include "common/log.h"
 #include "common/tmp-name.h"
 #include "ipc/error-code.h"
@@ -100,7 +101,7 @@ void PStream::UpdateStatus(uint64_t done, uint64_t total) {
   m_total = total;
 }
 
-int PStream::Skip(Channel&, uint8_t) { return P_ERR_TIMEOUT; }
+int PStream::Skip(Channel&, uint8_t) { return P_ERR_MALFORMED; }
 
 std::string PStream::Indent() const { return std::string(2 * std::min<uint64_t>(m_depth, kMaxIndent), ' '); }
 
@@ -148,7 +149,7 @@ int PStream::CheckSendable(const PObject& value, uint64_t depth) {
     }
     if (S_ISREG(st.st_mode) && static_cast<uint64_t>(st.st_size) < binary.offset + binary.length) {
       PLOVO_LIB_ERR("file length is incorrect.");
-      return P_ERR_TIMEOUT;
+      return P_ERR_MALFORMED;
     }
     return 0;
   }
@@ -161,7 +162,7 @@ int PStream::CheckSendable(const PObject& value, uint64_t depth) {
   // without bound either.
   if (depth >= kMaxDepth) {
     PLOVO_LIB_ERR("PStream: containers nested deeper than %lu", static_cast<unsigned long>(kMaxDepth));
-    return P_ERR_TIMEOUT;
+    return P_ERR_MALFORMED;
   }
   if (value.isArray()) {
     for (const PObject& element : value.asArray()) {
@@ -269,7 +270,9 @@ int PStream::Send(Channel& ch, const PObject::array_type& array) {
 }
 
 int PStream::Send(Channel& ch, const PObject::binary_type& binary) {
-  if (int r = ch.WriteByte(TAG_BINARY) != 0 || ch.WriteInt64(binary.length); r != 0) return ChannelFailure(r);
+  int header = ch.WriteByte(TAG_BINARY);
+  if (header == 0) header = ch.WriteInt64(binary.length);
+  if (header != 0) return ChannelFailure(header);
   std::unique_ptr<char[]> buffer(new (std::nothrow) char[kBlockSize]);
   if (!buffer) {
     PLOVO_LIB_ERR("malloc error");
@@ -308,7 +311,7 @@ int PStream::Send(Channel& ch, const PObject::binary_type& binary) {
   }
   if (sent < binary.length) {
     PLOVO_LIB_ERR("file length is incorrect.");
-    return P_ERR_TIMEOUT;
+    return P_ERR_MALFORMED;
   }
   if (m_trace) PLOVO_LIB_DBG("%sbinary, %lu bytes", Indent().c_str(), static_cast<unsigned long>(binary.length));
   return 0;
@@ -374,14 +377,14 @@ int PStream::RecvDispatch(Channel& ch, uint8_t tag, PObject& target) {
       if (int r = ch.ReadByte(&length); r != 0) return ChannelFailure(r);
       if (length != 0) {
         PLOVO_LIB_ERR("expect length 0, but we've got %u", length);
-        return P_ERR_TIMEOUT;
+        return P_ERR_MALFORMED;
       }
       target.clear();
       return 0;
     }
     default:
       PLOVO_LIB_ERR("PStream: unknown tag %u", tag);
-      return P_ERR_TIMEOUT;
+      return P_ERR_MALFORMED;
   }
   return ret > 0 ? 0 : ret;
 }
@@ -425,7 +428,7 @@ bool PStream::TooDeep() const {
 }
 
 int PStream::Recv(Channel& ch, PObject::map_type& map) {
-  if (TooDeep()) return P_ERR_TIMEOUT;
+  if (TooDeep()) return P_ERR_MALFORMED;
   if (m_trace) PLOVO_LIB_DBG("%s{", Indent().c_str());
   ++m_depth;
   int ret = 0;
@@ -437,7 +440,7 @@ int PStream::Recv(Channel& ch, PObject::map_type& map) {
     if (tag == TAG_END) break;
     if (tag != TAG_STRING) {
       PLOVO_LIB_ERR("PStream: expect string, but get tag %u", tag);
-      ret = P_ERR_TIMEOUT;
+      ret = P_ERR_MALFORMED;
       break;
     }
     std::string key;
@@ -458,7 +461,7 @@ int PStream::Recv(Channel& ch, PObject::map_type& map) {
 }
 
 int PStream::Recv(Channel& ch, PObject::array_type& array) {
-  if (TooDeep()) return P_ERR_TIMEOUT;
+  if (TooDeep()) return P_ERR_MALFORMED;
   if (m_trace) PLOVO_LIB_DBG("%s[", Indent().c_str());
   ++m_depth;
   int ret = 0;
@@ -488,7 +491,7 @@ int OpenRecvFile(PObject::binary_type& binary, const std::string& location, File
       // Resume: whatever follows the offset is stale and is replaced.
       if (binary.length != binary.offset && truncate(binary.path.c_str(), static_cast<off_t>(binary.offset)) != 0) {
         int error = errno;
-        PLOVO_LIB_ERR("truncate: %s (%d)", strerror(error), error);
+        PLOVO_LIB_ERR("truncate: %s (%d)", Plovo::ErrorText(error).c_str(), error);
         return P_ERR_INTERRUPTED;
       }
       mode = "ab";
@@ -551,7 +554,7 @@ int PStream::StoreBinary(Channel& ch, FILE* file, const std::string& path, uint6
     UpdateStatus(stored, length);
     if (written != got) {
       int error = errno;
-      PLOVO_LIB_ERR("fwrite(%s): %s", path.c_str(), strerror(error));
+      PLOVO_LIB_ERR("fwrite(%s): %s", path.c_str(), Plovo::ErrorText(error).c_str());
       return StoreError(error);
     }
     if (read != 0) return ChannelFailure(read);
@@ -562,7 +565,7 @@ int PStream::StoreBinary(Channel& ch, FILE* file, const std::string& path, uint6
   }
   if (fflush(file) != 0) {
     int error = errno;
-    PLOVO_LIB_ERR("fflush(%s): %s", path.c_str(), strerror(error));
+    PLOVO_LIB_ERR("fflush(%s): %s", path.c_str(), Plovo::ErrorText(error).c_str());
     return StoreError(error);
   }
   return 0;

@@ -3,7 +3,6 @@
 #include <fcntl.h>
 #include <sys/file.h>
 #include <sys/stat.h>
-#include <unistd.h>
 #include <velt/mount.h>
 #include <velt/vlibc.h>
 
@@ -16,6 +15,7 @@
 
 #include "common/log.h"
 #include "common/paths.h"
+#include "common/unique-fd.h"
 #include "common/utility.h"
 
 namespace {
@@ -34,30 +34,33 @@ std::atomic<std::chrono::milliseconds::rep> gStatusLockWaitMs{kStatusLockWait.co
 bool LockWithin(int fd, std::chrono::milliseconds wait, bool* timedOut) {
   const auto deadline = std::chrono::steady_clock::now() + wait;
   *timedOut = false;
-  while (flock(fd, LOCK_EX | LOCK_NB) != 0) {
-    if (errno != EWOULDBLOCK && errno != EINTR) return false;
+  for (;;) {
+    if (flock(fd, LOCK_EX | LOCK_NB) == 0) return true;
+    // A signal says nothing about the holder: ask again at once, without
+    // spending the wait on it.
+    if (errno == EINTR) continue;
+    if (errno != EWOULDBLOCK) return false;
     if (std::chrono::steady_clock::now() >= deadline) {
       *timedOut = true;
       return false;
     }
     std::this_thread::sleep_for(kStatusLockRetry);
   }
-  return true;
 }
 
 // Holds the exclusive lock on "status.lock" for one read or write of the
 // status file.
 class StatusLock {
  public:
-  StatusLock() {
-    fd_ = open(Plovo::Path::StatusLockFile().c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0440);
-    if (fd_ < 0) {
+  StatusLock()
+      : fd_(open(Plovo::Path::StatusLockFile().c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0440)) {
+    if (!fd_) {
       PLOVO_LOG(LOG_ERR, "Failed to open plovo status lock file.");
       return;
     }
     const std::chrono::milliseconds wait(gStatusLockWaitMs.load());
     bool timedOut = false;
-    if (!LockWithin(fd_, wait, &timedOut)) {
+    if (!LockWithin(fd_.get(), wait, &timedOut)) {
       PLOVO_LOG(LOG_ERR, "Failed to lock file.");
       if (timedOut) {
         PLOVO_LOG(LOG_ERR, "The plovo status lock is still held after %lld ms.",
@@ -68,9 +71,7 @@ class StatusLock {
     locked_ = true;
   }
   ~StatusLock() {
-    if (fd_ < 0) return;
-    if (locked_) flock(fd_, LOCK_UN);
-    close(fd_);
+    if (locked_) flock(fd_.get(), LOCK_UN);
   }
   StatusLock(const StatusLock&) = delete;
   StatusLock& operator=(const StatusLock&) = delete;
@@ -78,7 +79,7 @@ class StatusLock {
   bool locked() const { return locked_; }
 
  private:
-  int fd_ = -1;
+  Plovo::UniqueFd fd_;
   bool locked_ = false;
 };
 
@@ -157,6 +158,9 @@ int GetServiceStatus(ServiceStatus& status) {
   } catch (const std::exception& e) {
     PLOVO_LOG(LOG_ERR, "Unexpected failure: %s", e.what());
     return -1;
+  } catch (...) {
+    PLOVO_LOG(LOG_ERR, "Unexpected failure");
+    return -1;
   }
 }
 
@@ -165,6 +169,9 @@ int SetServiceStatus(const ServiceStatus& status) {
     return WriteServiceStatus(status);
   } catch (const std::exception& e) {
     PLOVO_LOG(LOG_ERR, "Unexpected failure: %s", e.what());
+    return -1;
+  } catch (...) {
+    PLOVO_LOG(LOG_ERR, "Unexpected failure");
     return -1;
   }
 }

@@ -9,10 +9,11 @@
 // is only a status, and tasks live in memory, so every start begins with
 // none. Every task reports schedule_id -1: schedules are not kept yet.
 //
-// One connection carries one command; they are served one at a time in one
-// thread. Each request gives one line on stderr ("list_task -> ok",
-// "run_task 3 -> error 3"). SIGINT, SIGTERM or a "stop" request (which gets
-// no answer) end it; the socket file is removed on the way out.
+// One connection carries one command; connections are served on several
+// threads, the commands one at a time. Each request gives one line on
+// stderr ("list_task -> ok", "run_task 3 -> error 3"). SIGINT, SIGTERM or a
+// "stop" request (which gets no answer) end it; the socket file is removed
+// on the way out.
 //
 // The "error_code" of a failed command:
 //   1  unknown action
@@ -24,12 +25,15 @@
 
 #include <cstdint>
 #include <cstdio>
+#include <functional>
 #include <map>
+#include <mutex>
 #include <string>
+#include <vector>
 
 #include "common/log.h"
 #include "common/paths.h"
-#include "ipc/simple-ipc.h"
+#include "ipc/command-server.h"
 
 namespace {
 
@@ -42,10 +46,6 @@ constexpr int kErrNotRunning = 8;
 // task has none. PObject has no signed kind: -1 travels as its 64-bit two's
 // complement and the module reads it back with asInt64().
 constexpr uint64_t kNoSchedule = static_cast<uint64_t>(-1);
-
-volatile sig_atomic_t g_stop = 0;
-
-void OnSignal(int) { g_stop = 1; }
 
 struct Task {
   // The request keys as last sent: add_task's, then whatever the set_*
@@ -98,11 +98,22 @@ PObject Strings(const PObject& fields, const char* key) {
 
 class DevDaemon {
  public:
-  Outcome Handle(const PObject& request);
+  // Every action this daemon answers, once, with its handler.
+  std::vector<CommandServer::Command> Commands();
+  // The answer to any other action.
+  CommandServer::Handler Unknown();
 
  private:
-  Outcome Add(const PObject& request);
+  using Command = std::function<Outcome(const PObject& request)>;
+  using TaskCommand = std::function<Outcome(uint64_t id, Task& task, const PObject& request)>;
+
+  // A handler that runs command with the lock held and logs its line.
+  CommandServer::Handler Logged(Command command);
+  // The same for a command on one task, which must exist.
+  CommandServer::Handler OnTask(TaskCommand command);
+
   Outcome List() const;
+  Outcome Add(const PObject& request);
   Outcome GetFilter(const Task& task) const;
   // Copies every argument of request into the task, except those that
   // address the command and, for set_task_setting, the fixed strategy.
@@ -110,9 +121,103 @@ class DevDaemon {
   bool NameTaken(const std::string& name, uint64_t except) const;
   PObject Describe(uint64_t id, const Task& task) const;
 
+  // Connections are served on several threads; commands run one at a time.
+  std::mutex mutex_;
   std::map<uint64_t, Task> tasks_;
   uint64_t nextId_ = 1;
 };
+
+std::vector<CommandServer::Command> DevDaemon::Commands() {
+  return {
+      {"list_task", Logged([this](const PObject&) { return List(); })},
+      {"add_task", Logged([this](const PObject& request) { return Add(request); })},
+      {"list_entry", Logged([](const PObject&) {
+         Outcome o = Ok();
+         o.answer["entry_list"].asArray();
+         return o;
+       })},
+      {"set_global_setting", Logged([](const PObject&) { return Ok(); })},
+      {"get_task_setting", OnTask([this](uint64_t id, Task& task, const PObject&) {
+         Outcome o = Ok();
+         const PObject described = Describe(id, task);
+         for (const auto& [key, value] : described.asMap()) o.answer[key] = value;
+         return o;
+       })},
+      {"get_filter_setting", OnTask([this](uint64_t, Task& task, const PObject&) { return GetFilter(task); })},
+      {"set_task_setting", OnTask([this](uint64_t id, Task& task, const PObject& request) {
+         if (request.hasMember("task_name") && NameTaken(request["task_name"].asStringRef(), id)) {
+           return Error(kErrConflict, "task name already exists");
+         }
+         Merge(request, task, true);
+         return Ok();
+       })},
+      {"set_trigger_time_setting", OnTask([](uint64_t, Task& task, const PObject& request) {
+         Merge(request, task, false);
+         Outcome o = Ok();
+         o.answer["schedule_id"] = kNoSchedule;
+         return o;
+       })},
+      {"set_filter_setting", OnTask([](uint64_t, Task& task, const PObject& request) {
+         Merge(request, task, false);
+         return Ok();
+       })},
+      {"run_task", OnTask([](uint64_t, Task& task, const PObject&) {
+         if (task.running) return Error(kErrConflict, "task is already running");
+         task.running = true;
+         return Ok();
+       })},
+      {"cancel_task", OnTask([](uint64_t, Task& task, const PObject&) {
+         if (!task.running) return Error(kErrNotRunning, "task is not running");
+         task.running = false;
+         return Ok();
+       })},
+      {"enable_task", OnTask([](uint64_t, Task& task, const PObject&) {
+         task.runnable = true;
+         return Ok();
+       })},
+      {"disable_task", OnTask([](uint64_t, Task& task, const PObject&) {
+         task.runnable = false;
+         return Ok();
+       })},
+      {"remove_task", OnTask([this](uint64_t id, Task&, const PObject&) {
+         tasks_.erase(id);
+         return Ok();
+       })},
+      // No answer: the sender does not wait for one. The main thread waits
+      // for the end signals, so a stop request is one more of them.
+      {"stop",
+       [](const PObject&) {
+         std::fprintf(stderr, "stop\n");
+         kill(getpid(), SIGTERM);
+         return PObject();
+       }},
+  };
+}
+
+CommandServer::Handler DevDaemon::Unknown() {
+  return Logged([](const PObject&) { return Error(kErrUnknownAction, "unknown action"); });
+}
+
+CommandServer::Handler DevDaemon::Logged(Command command) {
+  return [this, command](const PObject& request) {
+    std::lock_guard<std::mutex> lock(mutex_);
+    Outcome outcome = command(request);
+    const std::string& action = request["action"].asStringRef();
+    std::string line = action.empty() ? "(no action)" : action;
+    if (request.hasMember("task_id")) line += " " + std::to_string(request["task_id"].asUInt64());
+    std::fprintf(stderr, "%s -> %s\n", line.c_str(), outcome.log.c_str());
+    return outcome.answer;
+  };
+}
+
+CommandServer::Handler DevDaemon::OnTask(TaskCommand command) {
+  return Logged([this, command](const PObject& request) {
+    const uint64_t id = request["task_id"].asUInt64();
+    auto it = tasks_.find(id);
+    if (it == tasks_.end()) return Error(kErrNoSuchTask, "no such task");
+    return command(id, it->second, request);
+  });
+}
 
 bool DevDaemon::NameTaken(const std::string& name, uint64_t except) const {
   for (const auto& [id, task] : tasks_) {
@@ -164,6 +269,13 @@ PObject DevDaemon::Describe(uint64_t id, const Task& task) const {
   return t;
 }
 
+Outcome DevDaemon::List() const {
+  Outcome o = Ok();
+  PObject::array_type& list = o.answer["task_list"].asArray();
+  for (const auto& [id, task] : tasks_) list.push_back(Describe(id, task));
+  return o;
+}
+
 Outcome DevDaemon::Add(const PObject& request) {
   if (NameTaken(request["task_name"].asStringRef(), 0)) {
     return Error(kErrConflict, "task name already exists");
@@ -175,13 +287,6 @@ Outcome DevDaemon::Add(const PObject& request) {
   return o;
 }
 
-Outcome DevDaemon::List() const {
-  Outcome o = Ok();
-  PObject::array_type& list = o.answer["task_list"].asArray();
-  for (const auto& [id, task] : tasks_) list.push_back(Describe(id, task));
-  return o;
-}
-
 Outcome DevDaemon::GetFilter(const Task& task) const {
   Outcome o = Ok();
   for (const char* key :
@@ -189,97 +294,6 @@ Outcome DevDaemon::GetFilter(const Task& task) const {
     o.answer[key] = Strings(task.fields, key);
   }
   return o;
-}
-
-Outcome DevDaemon::Handle(const PObject& request) {
-  const std::string action = request["action"].asStringRef();
-  if (action == "list_task") return List();
-  if (action == "add_task") return Add(request);
-  if (action == "list_entry") {
-    Outcome o = Ok();
-    o.answer["entry_list"].asArray();
-    return o;
-  }
-  if (action == "set_global_setting") return Ok();
-
-  static const char* const kTaskActions[] = {
-      "get_task_setting", "get_filter_setting", "set_task_setting", "set_trigger_time_setting",
-      "set_filter_setting", "run_task", "cancel_task", "enable_task", "disable_task",
-      "remove_task"};
-  bool known = false;
-  for (const char* name : kTaskActions) known = known || action == name;
-  if (!known) return Error(kErrUnknownAction, "unknown action");
-
-  const uint64_t id = request["task_id"].asUInt64();
-  auto it = tasks_.find(id);
-  if (it == tasks_.end()) return Error(kErrNoSuchTask, "no such task");
-  Task& task = it->second;
-
-  if (action == "get_task_setting") {
-    Outcome o = Ok();
-    const PObject described = Describe(id, task);
-    for (const auto& [key, value] : described.asMap()) o.answer[key] = value;
-    return o;
-  }
-  if (action == "get_filter_setting") return GetFilter(task);
-  if (action == "set_task_setting") {
-    if (request.hasMember("task_name") && NameTaken(request["task_name"].asStringRef(), id)) {
-      return Error(kErrConflict, "task name already exists");
-    }
-    Merge(request, task, true);
-    return Ok();
-  }
-  if (action == "set_trigger_time_setting" || action == "set_filter_setting") {
-    Merge(request, task, false);
-    Outcome o = Ok();
-    if (action == "set_trigger_time_setting") o.answer["schedule_id"] = kNoSchedule;
-    return o;
-  }
-  if (action == "run_task") {
-    if (task.running) return Error(kErrConflict, "task is already running");
-    task.running = true;
-    return Ok();
-  }
-  if (action == "cancel_task") {
-    if (!task.running) return Error(kErrNotRunning, "task is not running");
-    task.running = false;
-    return Ok();
-  }
-  if (action == "enable_task" || action == "disable_task") {
-    task.runnable = action == "enable_task";
-    return Ok();
-  }
-  tasks_.erase(it);  // remove_task
-  return Ok();
-}
-
-// Serves one accepted connection. Returns false when the request was "stop".
-bool Serve(DevDaemon& daemon, int fd) {
-  IPCSender peer;
-  if (peer.assign(fd) != 0) {
-    close(fd);
-    return true;
-  }
-  peer.channel().SetTimeout(5);
-  PObject request;
-  if (peer.recv(request) != 0) {
-    std::fprintf(stderr, "plovod-dev: unreadable request\n");
-    return true;
-  }
-  const std::string action = request["action"].asStringRef();
-  if (action == "stop") {
-    std::fprintf(stderr, "stop\n");
-    return false;
-  }
-  Outcome outcome = daemon.Handle(request);
-  std::string line = action.empty() ? "(no action)" : action;
-  if (request.hasMember("task_id")) line += " " + std::to_string(request["task_id"].asUInt64());
-  std::fprintf(stderr, "%s -> %s\n", line.c_str(), outcome.log.c_str());
-  const bool wantsAnswer = !request.hasMember("need_ack") || request["need_ack"].asBool();
-  if (wantsAnswer && peer.send(outcome.answer) != 0) {
-    std::fprintf(stderr, "plovod-dev: the answer to %s could not be sent\n", action.c_str());
-  }
-  return true;
 }
 
 }  // namespace
@@ -295,32 +309,30 @@ int main(int argc, char**) {
     if (LOG_PRI(priority) <= LOG_WARNING) std::fprintf(stderr, "plovod-dev: %s\n", line.c_str());
   });
 
-  struct sigaction action {};
-  action.sa_handler = OnSignal;
-  sigemptyset(&action.sa_mask);
-  sigaction(SIGINT, &action, nullptr);
-  sigaction(SIGTERM, &action, nullptr);
+  // The end signals are taken by sigwait below; blocked before any thread
+  // starts, so that no other thread is interrupted by them.
+  sigset_t ends;
+  sigemptyset(&ends);
+  sigaddset(&ends, SIGINT);
+  sigaddset(&ends, SIGTERM);
+  pthread_sigmask(SIG_BLOCK, &ends, nullptr);
   signal(SIGPIPE, SIG_IGN);  // a client that hangs up early must not end us
 
+  DevDaemon daemon;
+  CommandServer server(daemon.Commands(), daemon.Unknown(), [](const std::string& problem) {
+    std::fprintf(stderr, "plovod-dev: %s\n", problem.c_str());
+  });
   const std::string path = Plovo::Path::DaemonSocket();
-  IPCListener listener;
-  if (listener.prepare(path) != 0) {  // replaces a stale socket file
+  if (server.Start(path) != 0) {  // replaces a stale socket file
     std::fprintf(stderr, "plovod-dev: cannot listen on %s (does its folder exist?)\n",
                  path.c_str());
     return 1;
   }
-  // A short wait, so that a signal is noticed promptly.
-  listener.setTimeout({0, 200000});
   std::fprintf(stderr, "plovod-dev: listening on %s\n", path.c_str());
 
-  DevDaemon daemon;
-  bool running = true;
-  while (running && !g_stop) {
-    if (!listener.isReady()) continue;
-    const int fd = listener.accept();
-    if (fd >= 0) running = Serve(daemon, fd);
-  }
-  listener.close();
+  int received = 0;
+  sigwait(&ends, &received);
+  server.Stop();
   std::fprintf(stderr, "plovod-dev: stopped\n");
   return 0;
 }

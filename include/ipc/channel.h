@@ -22,6 +22,20 @@
 // Threading: one thread at a time uses a channel. The cancel flag is the one
 // cross-thread input: another thread may set the pointed-to int to stop a
 // blocked read or flush within one interval.
+//
+// Binary interface: code compiled separately against this class (a
+// subclass, another program's build of it) depends on its layout, so some
+// members are here for their place rather than for a use in this module.
+// Every virtual
+// function is a slot, declared in slot order from the destructor to
+// SwitchChannelOp: add none, drop none, reorder none, and keep new members
+// non-virtual (as SetDeadline and Capacity are). The fields from m_handle to
+// m_allow_untrust keep their order and types; new fields go after them. The
+// static certificate paths are named data of the interface. Members marked
+// "binary interface" below have no other reason to exist: Convert has no
+// caller, CreateSock, SetLinger and SetNonBlock could be plain functions,
+// and SwitchChannelOp takes a mode number (kPlainMode or kTlsMode) rather
+// than a type of its own.
 #ifndef PLOVO_IPC_CHANNEL_H
 #define PLOVO_IPC_CHANNEL_H
 
@@ -103,26 +117,30 @@ class Channel {
   static void SetPriKeyPath(const std::string& path) { m_key_path = path; }
   static void SetVerifyCAPath(const std::string& path) { m_ca_path = path; }
 
-  static std::string m_cert_path;  // server certificate, PEM
-  static std::string m_key_path;   // server private key, PEM
-  static std::string m_ca_path;    // CA file a client verifies the server with
+  // Server certificate, server private key (both PEM), and the CA file a
+  // client verifies the server with.
+  static std::string m_cert_path;  // binary interface
+  static std::string m_key_path;   // binary interface
+  static std::string m_ca_path;    // binary interface
 
  protected:
   // Fills the read buffer with at least want bytes.
   virtual int ReadMore(unsigned long want);
   // Byte order reversal at each width.
-  virtual unsigned long Convert(unsigned long value);
-  virtual unsigned int Convert(unsigned int value);
-  virtual unsigned short Convert(unsigned short value);
+  virtual unsigned long Convert(unsigned long value);    // binary interface
+  virtual unsigned int Convert(unsigned int value);      // binary interface
+  virtual unsigned short Convert(unsigned short value);  // binary interface
   // An IPv4 stream socket, or -1.
-  virtual int CreateSock();
-  virtual int SetLinger(int fd, int seconds);
-  virtual int SetNonBlock(int fd);
+  virtual int CreateSock();                   // binary interface
+  virtual int SetLinger(int fd, int seconds);  // binary interface
+  virtual int SetNonBlock(int fd);             // binary interface
   // Non-blocking connect with the channel's waits; every unanswered
   // interval counts 3 towards the time limit.
   virtual int ConnectWithTimeout(int fd, const char* ip, int port);
-  // Mode 1 selects the plain operations, any other mode the TLS ones.
-  virtual void SwitchChannelOp(int mode);
+  // kPlainMode selects the plain operations, any other mode the TLS ones.
+  virtual void SwitchChannelOp(int mode);  // binary interface
+  static constexpr int kPlainMode = 1;
+  static constexpr int kTlsMode = 2;
 
  private:
   // The five operations of a mode.
@@ -159,8 +177,9 @@ class Channel {
   // The interval of one wait, cut short to what is left before the deadline.
   timeval WaitInterval() const;
 
+  // The fields of the binary interface, in its order.
   void* m_handle = nullptr;  // plain: int* holding the descriptor; TLS: SSL*
-  const Ops* m_ops = &kPlainOps;
+  Ops m_ops;  // the five operations in place, not a pointer to a table
   char* m_wbuf = nullptr;
   unsigned long m_whead = 0;
   unsigned long m_wsize = 0;
@@ -171,10 +190,11 @@ class Channel {
   timeval m_interval{1, 0};
   unsigned int m_timeout = 60;
   int* m_flag = nullptr;
-  bool m_has_deadline = false;
-  std::chrono::steady_clock::time_point m_deadline;
   bool m_ssl = false;
   bool m_allow_untrust = true;
+
+  bool m_has_deadline = false;
+  std::chrono::steady_clock::time_point m_deadline;
   // Whether the per-call debug lines are written; decided once per channel
   // so that a server that masks them out pays nothing for them.
   bool m_trace;

@@ -10,7 +10,11 @@ enum PErrorCode {
   P_ERR_IO = -2,                 // peer closed, recv/send error, closed channel
   P_ERR_SYSTEM = -3,             // a system call failed
   P_ERR_INVALID_ARGUMENT = -4,   // bad argument, oversize block, disk full on receive
-  P_ERR_TIMEOUT = -5,            // time limit reached; malformed stream in PStream
+  P_ERR_TIMEOUT = -5,            // time limit reached
+  // PStream's code for a malformed or too deeply nested value and for a
+  // source file shorter than its binary says. It shares the timeout's code
+  // (and text) on the wire, where peers expect -5 for both.
+  P_ERR_MALFORMED = -5,
   P_ERR_SSL_VERIFY = -6,         // the TLS peer's certificate did not verify
   P_ERR_STOPPED = -7,
   P_ERR_IGNORE = -8,

@@ -6,17 +6,13 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <thread>
 
 #include "common/paths.h"
-#include "ipc/simple-ipc.h"
 
 namespace plovo_test {
 
-DaemonAnswer DaemonAnswer::Reply(const PObject& map) {
-  DaemonAnswer a;
-  a.map = map;
-  return a;
-}
+DaemonAnswer DaemonAnswer::Reply(const PObject& map) { return {Kind::Map, map, "", 0}; }
 
 DaemonAnswer DaemonAnswer::Ok() {
   PObject ok;
@@ -24,38 +20,16 @@ DaemonAnswer DaemonAnswer::Ok() {
   return Reply(ok);
 }
 
-DaemonAnswer DaemonAnswer::Bytes(const std::string& raw) {
-  DaemonAnswer a;
-  a.kind = Kind::Raw;
-  a.raw = raw;
-  return a;
-}
+DaemonAnswer DaemonAnswer::Bytes(const std::string& raw) { return {Kind::Raw, PObject(), raw, 0}; }
 
-DaemonAnswer DaemonAnswer::Nothing() {
-  DaemonAnswer a;
-  a.kind = Kind::None;
-  return a;
-}
+DaemonAnswer DaemonAnswer::Nothing() { return {Kind::None, PObject(), "", 0}; }
 
-DaemonAnswer DaemonAnswer::Close() {
-  DaemonAnswer a;
-  a.kind = Kind::CloseEarly;
-  return a;
-}
+DaemonAnswer DaemonAnswer::Close() { return {Kind::CloseEarly, PObject(), "", 0}; }
 
 TestDaemon::TestDaemon(const std::string& socketPath)
-    : path_(socketPath.empty() ? Plovo::Path::DaemonSocket() : socketPath) {
-  int fd = IPCListener::OpenDomainSocket(path_);
-  if (fd < 0) {
-    ADD_FAILURE() << "test daemon cannot listen at " << path_;
-    return;
-  }
-  thread_ = std::thread(&TestDaemon::Serve, this, fd);
-}
-
-TestDaemon::~TestDaemon() {
-  stop_ = true;
-  if (thread_.joinable()) thread_.join();
+    : path_(socketPath.empty() ? Plovo::Path::DaemonSocket() : socketPath),
+      server_([this](CommandServer::Connection& connection) { Serve(connection); }) {
+  if (server_.Start(path_) != 0) ADD_FAILURE() << "test daemon cannot listen at " << path_;
 }
 
 void TestDaemon::Script(std::vector<DaemonAnswer> answers) {
@@ -82,41 +56,21 @@ DaemonAnswer TestDaemon::NextAnswer() {
   return answer;
 }
 
-// Polls in short rounds so that the destructor stops the thread promptly.
-void TestDaemon::Serve(int listenFd) {
-  while (!stop_) {
-    pollfd p{listenFd, POLLIN, 0};
-    if (poll(&p, 1, 50) <= 0) continue;
-    int fd = accept4(listenFd, nullptr, nullptr, SOCK_CLOEXEC);
-    if (fd < 0) continue;
-    ++connections_;
-    Handle(fd);
-  }
-  IPCListener::CloseDomainSocket(listenFd);
-}
-
-void TestDaemon::Handle(int fd) {
+void TestDaemon::Serve(CommandServer::Connection& connection) {
+  ++connections_;
   DaemonAnswer answer = NextAnswer();
-  if (answer.kind == DaemonAnswer::Kind::CloseEarly) {
-    close(fd);
-    return;
-  }
-  IPCSender peer;  // owns fd from here on
-  if (peer.assign(fd) != 0) {
-    close(fd);
-    return;
-  }
-  peer.channel().SetTimeout(5);
+  if (answer.kind == DaemonAnswer::Kind::CloseEarly) return;
   PObject request;
-  if (peer.recv(request) != 0) return;
+  if (connection.Recv(request) != 0) return;
   {
     std::lock_guard<std::mutex> lock(mutex_);
     requests_.push_back(request);
   }
   if (answer.delayMs > 0) std::this_thread::sleep_for(std::chrono::milliseconds(answer.delayMs));
+  const int fd = connection.fd();
   switch (answer.kind) {
     case DaemonAnswer::Kind::Map:
-      peer.send(answer.map);
+      connection.Send(answer.map);
       break;
     case DaemonAnswer::Kind::Raw:
       // Written past the channel so that no framing is added.
@@ -125,11 +79,11 @@ void TestDaemon::Handle(int fd) {
       }
       break;
     case DaemonAnswer::Kind::None: {
-      // Wait for the client to hang up (or the daemon to stop).
+      // Until the client hangs up; stopping the server shuts the socket
+      // down, which ends the wait too.
       char byte;
-      while (!stop_) {
-        pollfd p{fd, POLLIN, 0};
-        if (poll(&p, 1, 50) > 0 && recv(fd, &byte, 1, MSG_DONTWAIT) <= 0) break;
+      pollfd p{fd, POLLIN, 0};
+      while (poll(&p, 1, -1) > 0 && recv(fd, &byte, 1, 0) > 0) {
       }
       break;
     }

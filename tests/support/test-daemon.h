@@ -1,6 +1,6 @@
-// A stand-in for the copy daemon: listens on the sandbox's daemon socket
-// (or any path) in a thread of its own, records every request it receives
-// and answers each from a script.
+// A stand-in for the copy daemon: a CommandServer on the sandbox's daemon
+// socket (or any path) that records every request it receives and answers
+// each from a script.
 //
 // The script is a list of answers used in order, one per connection; the
 // last one repeats. Without a script every request is answered {"ack": "ok"}.
@@ -10,9 +10,9 @@
 #include <atomic>
 #include <mutex>
 #include <string>
-#include <thread>
 #include <vector>
 
+#include "ipc/command-server.h"
 #include "ipc/pobject.h"
 
 namespace plovo_test {
@@ -45,7 +45,6 @@ class TestDaemon {
   // Starts listening at once; an empty path means the sandbox's daemon
   // socket. Fails the current test when the socket cannot be opened.
   explicit TestDaemon(const std::string& socketPath = "");
-  ~TestDaemon();
   TestDaemon(const TestDaemon&) = delete;
   TestDaemon& operator=(const TestDaemon&) = delete;
 
@@ -61,8 +60,7 @@ class TestDaemon {
   const std::string& SocketPath() const { return path_; }
 
  private:
-  void Serve(int listenFd);
-  void Handle(int fd);
+  void Serve(CommandServer::Connection& connection);
   DaemonAnswer NextAnswer();
 
   std::string path_;
@@ -71,8 +69,8 @@ class TestDaemon {
   size_t next_ = 0;
   std::vector<PObject> requests_;
   std::atomic<int> connections_{0};
-  std::atomic<bool> stop_{false};
-  std::thread thread_;
+  // Last, so that it stops before what its connections use goes.
+  CommandServer server_;
 };
 
 }  // namespace plovo_test
