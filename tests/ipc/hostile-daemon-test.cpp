@@ -18,6 +18,7 @@
 #include <thread>
 
 #include "common/paths.h"
+#include "ipc/command-server.h"
 #include "ipc/daemon-ipc.h"
 #include "log-capture.h"
 #include "sandbox.h"
@@ -74,35 +75,18 @@ bool ClientGoneWithin(int fd, std::chrono::seconds limit) {
   return false;
 }
 
-// A daemon on the sandbox socket that accepts one connection and runs its
-// behaviour on it in a thread of its own. Every behaviour is bounded in
-// time, so a client that waits for ever fails the test instead of hanging it.
+// A daemon on the sandbox socket that serves each connection with a
+// behaviour on its raw socket. Every behaviour is bounded in time, so a
+// client that waits for ever fails the test instead of hanging it.
 class HostilePeer {
  public:
-  explicit HostilePeer(std::function<void(int)> behaviour) {
-    listen_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    Plovo::Path::DaemonSocket().copy(addr.sun_path, sizeof(addr.sun_path) - 1);
-    unlink(addr.sun_path);
-    EXPECT_EQ(bind(listen_, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)), 0);
-    EXPECT_EQ(listen(listen_, 4), 0);
-    thread_ = std::thread([this, behaviour] {
-      int fd = accept(listen_, nullptr, nullptr);
-      if (fd < 0) return;
-      behaviour(fd);
-      close(fd);
-    });
-  }
-  ~HostilePeer() {
-    shutdown(listen_, SHUT_RDWR);  // wakes an accept that never came
-    thread_.join();
-    close(listen_);
+  explicit HostilePeer(std::function<void(int)> behaviour)
+      : server_([behaviour](CommandServer::Connection& connection) { behaviour(connection.fd()); }) {
+    EXPECT_EQ(server_.Start(Plovo::Path::DaemonSocket()), 0);
   }
 
  private:
-  int listen_;
-  std::thread thread_;
+  CommandServer server_;
 };
 
 class HostileDaemonTest : public plovo_test::SandboxTest {
@@ -272,14 +256,14 @@ TEST_F(HostileDaemonTest, ARefusedCommandPutsNoByteOnTheWire) {
   missingFile["z"] = file;
   for (const PObject* command : {&longString, &buffer, &deep, &missingFile}) {
     std::promise<std::string> received;
-    {
-      HostilePeer peer([&](int fd) { received.set_value(ReadToEnd(fd)); });
-      PObject response;
-      DaemonIPC ipc;
-      ipc.SetTimeLimit(2);
-      EXPECT_EQ(ipc.SendCommand(*command, response), -1);
-    }
-    EXPECT_EQ(received.get_future().get().size(), 0u);
+    std::future<std::string> bytes = received.get_future();
+    HostilePeer peer([&](int fd) { received.set_value(ReadToEnd(fd)); });
+    PObject response;
+    DaemonIPC ipc;
+    ipc.SetTimeLimit(2);
+    EXPECT_EQ(ipc.SendCommand(*command, response), -1);
+    ASSERT_EQ(bytes.wait_for(std::chrono::seconds(10)), std::future_status::ready);
+    EXPECT_EQ(bytes.get().size(), 0u);
   }
 }
 
