@@ -10,10 +10,10 @@
 #include <cerrno>
 #include <chrono>
 #include <cstdlib>
-#include <exception>
 #include <thread>
 
 #include "common/log.h"
+#include "common/no-throw.h"
 #include "common/paths.h"
 #include "common/unique-fd.h"
 #include "common/utility.h"
@@ -151,29 +151,12 @@ int WriteServiceStatus(const ServiceStatus& status) {
 
 }  // namespace
 
-// Entry points of the module: nothing may be thrown to the caller.
 int GetServiceStatus(ServiceStatus& status) {
-  try {
-    return ReadServiceStatus(status);
-  } catch (const std::exception& e) {
-    PLOVO_LOG(LOG_ERR, "Unexpected failure: %s", e.what());
-    return -1;
-  } catch (...) {
-    PLOVO_LOG(LOG_ERR, "Unexpected failure");
-    return -1;
-  }
+  return Plovo::NoThrow([&] { return ReadServiceStatus(status); }, -1);
 }
 
 int SetServiceStatus(const ServiceStatus& status) {
-  try {
-    return WriteServiceStatus(status);
-  } catch (const std::exception& e) {
-    PLOVO_LOG(LOG_ERR, "Unexpected failure: %s", e.what());
-    return -1;
-  } catch (...) {
-    PLOVO_LOG(LOG_ERR, "Unexpected failure");
-    return -1;
-  }
+  return Plovo::NoThrow([&] { return WriteServiceStatus(status); }, -1);
 }
 
 bool IsPkgEnable() { return VLIBCFileExist(Plovo::Path::EnabledFile().c_str()) == 1; }

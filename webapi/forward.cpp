@@ -36,12 +36,19 @@ bool PlovoHandle::Forward(int built, const PObject& command, PObject& reply, con
   return true;
 }
 
-bool PlovoHandle::ReadTaskId(uint64_t& id) {
-  const auto param = request->GetAndCheckIntegral<uint64_t>("id", VELT::PARAM_REQUIRED, nullptr);
-  if (param.IsInvalid()) {
+bool PlovoHandle::ForwardTaskIdCmd(int (*build)(unsigned long, PObject&), PObject& reply, const char* what,
+                                   std::initializer_list<int32_t> okCodes, const char* file, int line) {
+  const auto id = request->GetAndCheckIntegral<uint64_t>("id", VELT::PARAM_REQUIRED, nullptr);
+  if (id.IsInvalid()) {
     response->SetError(402);
     return false;
   }
-  id = param.Get();
-  return true;
+  PObject command;
+  return Forward(build(id.Get(), command), command, reply, what, okCodes, file, line);
+}
+
+void PlovoHandle::SendTaskIdCmd(int (*build)(unsigned long, PObject&), std::initializer_list<int32_t> okCodes,
+                                const char* file, int line) {
+  PObject reply;
+  if (ForwardTaskIdCmd(build, reply, "task", okCodes, file, line)) response->SetSuccess();
 }

@@ -1,27 +1,24 @@
 #include "webapi/plovo.h"
 
 #include <algorithm>
-#include <exception>
 #include <vector>
 
 #include "common/log.h"
+#include "common/no-throw.h"
 #include "common/run-as.h"
 #include "ipc/pobject.h"
 #include "service/service-ctrl.h"
 #include "webapi/methods.h"
 
 void Process(VELT::APIRequest* request, VELT::APIResponse* response) {
-  // Nothing may be thrown into the web server.
-  try {
-    PlovoHandle handle(request, response);
-    handle.Process();
-  } catch (const std::exception& e) {
-    PLOVO_LOG(LOG_ERR, "Unexpected failure: %s", e.what());
-    response->SetError(401);
-  } catch (...) {
-    PLOVO_LOG(LOG_ERR, "Unexpected failure");
-    response->SetError(401);
-  }
+  const bool done = Plovo::NoThrow(
+      [&] {
+        PlovoHandle handle(request, response);
+        handle.Process();
+        return true;
+      },
+      false);
+  if (!done) response->SetError(401);
 }
 
 PlovoHandle::PlovoHandle(VELT::APIRequest* request, VELT::APIResponse* response)

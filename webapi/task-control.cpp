@@ -1,6 +1,5 @@
 // "delete", "run", "enable", "disable" and "cancel": one daemon command on
 // one task. Whether the task exists is the daemon's answer.
-#include "common/log.h"
 #include "ipc/plovo-command.h"
 #include "webapi/plovo.h"
 
@@ -10,14 +9,6 @@ namespace {
 constexpr int32_t kNothingToCancel = 8;
 
 }  // namespace
-
-void PlovoHandle::SendTaskIdCmd(int (*build)(unsigned long, PObject&), std::initializer_list<int32_t> okCodes) {
-  uint64_t id = 0;
-  if (!ReadTaskId(id)) return;
-  PObject command, reply;
-  if (!Forward(build(id, command), command, reply, "task", okCodes)) return;
-  response->SetSuccess();
-}
 
 void PlovoHandle::Delete() { SendTaskIdCmd(Plovo::DeleteTaskCmd); }
 void PlovoHandle::Run() { SendTaskIdCmd(Plovo::StartTaskCmd); }

@@ -124,10 +124,8 @@ void PlovoHandle::List() {
 }
 
 void PlovoHandle::Get() {
-  uint64_t id = 0;
-  if (!ReadTaskId(id)) return;
-  PObject command, reply;
-  if (!Forward(Plovo::GetTaskSettingCmd(id, command), command, reply, "GetSetting")) return;
+  PObject reply;
+  if (!ForwardTaskIdCmd(Plovo::GetTaskSettingCmd, reply, "GetSetting")) return;
   Json::Value data(Json::objectValue);
   setJsonTask(reply, data["task"]);
   response->SetSuccess(data);

@@ -266,10 +266,8 @@ void PlovoHandle::SetFilter() {
 }
 
 void PlovoHandle::GetFilter() {
-  uint64_t id = 0;
-  if (!ReadTaskId(id)) return;
-  PObject command, reply;
-  if (!Forward(Plovo::GetFilterSettingCmd(id, command), command, reply, "GetFilter")) return;
+  PObject reply;
+  if (!ForwardTaskIdCmd(Plovo::GetFilterSettingCmd, reply, "GetFilter")) return;
   Json::Value filter(Json::objectValue);
   filter["white_list"]["extensions"] = convertToJsonArray(reply["white_ext"].asArray());
   filter["white_list"]["names"] = convertToJsonArray(reply["white_name"].asArray());

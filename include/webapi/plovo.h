@@ -121,13 +121,16 @@ class PlovoHandle {
   void SetGlobalSetting();
   void GetLogList();
 
-  // Reads the request's task "id"; false, after answering 402, when it is
-  // missing or not an unsigned integer.
-  bool ReadTaskId(uint64_t& id);
-  // Reads "id", builds the command with build and sends it; null data on
-  // success. Delete, Run, Enable, Disable and Cancel are this with their
-  // builder; daemon codes in okCodes count as success.
-  void SendTaskIdCmd(int (*build)(unsigned long, PObject&), std::initializer_list<int32_t> okCodes = {});
+  // Reads the request's task "id" (402 when it is missing or not an
+  // unsigned integer), builds the command with build and forwards it (see
+  // Forward). True when the reply is there to be read.
+  bool ForwardTaskIdCmd(int (*build)(unsigned long, PObject&), PObject& reply, const char* what,
+                        std::initializer_list<int32_t> okCodes = {}, const char* file = __builtin_FILE(),
+                        int line = __builtin_LINE());
+  // ForwardTaskIdCmd answered with null data on success. Delete, Run,
+  // Enable, Disable and Cancel are this with their builder.
+  void SendTaskIdCmd(int (*build)(unsigned long, PObject&), std::initializer_list<int32_t> okCodes = {},
+                     const char* file = __builtin_FILE(), int line = __builtin_LINE());
   // Sends command and reads the reply. A failure whose "error_code" is in
   // okCodes counts as success. Otherwise logs "Failed to send <what>
   // command, res=[<reply>]" under the calling action's file and line, and
