@@ -3,28 +3,23 @@
 #include <fcntl.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
 #include <velt/dev.h>
-#include <velt/ea.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <filesystem>
-#include <fstream>
 #include <random>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "log-capture.h"
 #include "sandbox.h"
 
 namespace {
 
 namespace fs = std::filesystem;
-using plovo_test::LogCapture;
 
 class FileOpTest : public plovo_test::SandboxTest {
  protected:
@@ -35,10 +30,19 @@ class FileOpTest : public plovo_test::SandboxTest {
     for (char& c : s) c = static_cast<char>(gen());
     return s;
   }
-  static std::string Slurp(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
-    return std::string(std::istreambuf_iterator<char>(in), {});
+  void TearDown() override {
+    for (const std::string& dir : mounted_) umount2(dir.c_str(), MNT_DETACH);
+    SandboxTest::TearDown();
   }
+  // A file system of its own at dir, so that the disk can fill and a move
+  // can cross file systems; false where this host allows no mount.
+  bool MountTmpfs(const std::string& dir, const char* options) {
+    MakeDir(dir);
+    if (mount("tmpfs", Path(dir).c_str(), "tmpfs", 0, options) != 0) return false;
+    mounted_.push_back(Path(dir));
+    return true;
+  }
+  std::vector<std::string> mounted_;
 };
 
 TEST_F(FileOpTest, GetFileInfoDescribesKindsWithoutFollowingLinks) {
@@ -46,26 +50,25 @@ TEST_F(FileOpTest, GetFileInfoDescribesKindsWithoutFollowingLinks) {
   MakeDir("/d");
   ASSERT_EQ(symlink(Path("/d").c_str(), Path("/link").c_str()), 0);
   ASSERT_EQ(mkfifo(Path("/fifo").c_str(), 0600), 0);
-  const std::pair<const char*, int> kinds[] = {{"/f", 1}, {"/d", 2}, {"/link", 3}, {"/fifo", 6}};
-  for (const auto& [name, type] : kinds) {
+  const struct {
+    const char* path;
+    bool exists;
+    int type;
+    const char* name;
+  } cases[] = {{"/f", true, 1, "f"},         {"/d", true, 2, "d"},        {"/link", true, 3, "link"},
+               {"/fifo", true, 6, "fifo"},   {"/no/such", false, 1, "such"},
+               {"/f/below", false, 1, "below"}};  // ENOTDIR counts as missing
+  for (const auto& c : cases) {
     LocalFileInfo info;
-    ASSERT_EQ(GetFileInfo(Path(name), info), 0) << name;
-    EXPECT_TRUE(info.exists) << name;
-    EXPECT_EQ(info.type, type) << name;
-    EXPECT_EQ(info.name, std::string(name + 1));
-    if (type == 1) {
-      EXPECT_EQ(info.size, 5);
+    info.size = 99;
+    ASSERT_EQ(GetFileInfo(Path(c.path), info), 0) << c.path;
+    EXPECT_EQ(info.exists, c.exists) << c.path;
+    EXPECT_EQ(info.type, c.type) << c.path;
+    EXPECT_EQ(info.name, c.name);
+    if (c.type == 1) {
+      EXPECT_EQ(info.size, c.exists ? 5 : 0) << c.path;
     }
   }
-
-  LocalFileInfo missing;
-  missing.size = 99;
-  EXPECT_EQ(GetFileInfo(Path("/no/such"), missing), 0);
-  EXPECT_FALSE(missing.exists);
-  EXPECT_EQ(missing.type, 1);
-  EXPECT_EQ(missing.size, 0);
-  EXPECT_EQ(missing.name, "such");
-  EXPECT_EQ(GetFileInfo(Path("/f/below"), missing), 0) << "ENOTDIR counts as missing";
 }
 
 TEST_F(FileOpTest, MKDirCreatesOrAcceptsFoldersAndRefusesFiles) {
@@ -75,11 +78,7 @@ TEST_F(FileOpTest, MKDirCreatesOrAcceptsFoldersAndRefusesFiles) {
   EXPECT_EQ(FSMKDir(Path("/x/y"), false, -1, -1), -2) << "parent missing, not recursive";
 
   WriteFile("/file", "");
-  LogCapture log;
   EXPECT_EQ(FSMKDir(Path("/file"), true, -1, -1), -1);
-  ASSERT_EQ(log.Lines().size(), 1u) << log.Dump();
-  EXPECT_EQ(log.Lines()[0].text.rfind("[ERR] file-op(", 0), 0u) << log.Dump();
-  EXPECT_TRUE(log.Contains(LOG_ERR, "): FSMKDir: Create a folder but local file system is not directory '1'"));
   EXPECT_EQ(FSMKDirP(Path("/file/sub"), -1, -1), -1);
 }
 
@@ -89,22 +88,15 @@ TEST_F(FileOpTest, KernelCopyIsExactIncludingTailAndEmptyFiles) {
   EXPECT_EQ(FSCopy(Path("/src"), Path("/dst"), false), 0);
   EXPECT_TRUE(ReadFile("/dst") == data);
 
-  // Overwrite a longer file: it must be truncated.
-  WriteFile("/short", "abc");
-  EXPECT_EQ(FSCopy(Path("/short"), Path("/dst"), true), 0);
-  EXPECT_EQ(ReadFile("/dst"), "abc");
-  EXPECT_FALSE(Exists("/short"));
-
+  // Onto the longer copy: it must be truncated.
   WriteFile("/empty", "");
-  EXPECT_EQ(FSCopy(Path("/empty"), Path("/dst"), false), 0);
+  EXPECT_EQ(FSCopy(Path("/empty"), Path("/dst"), true), 0);
   EXPECT_EQ(ReadFile("/dst"), "");
+  EXPECT_FALSE(Exists("/empty"));
 
-  LogCapture log;
   EXPECT_EQ(FSCopy(Path("/src"), Path("/src"), false), -1);
   EXPECT_TRUE(ReadFile("/src") == data) << "a copy onto itself must not truncate the source";
   EXPECT_EQ(FSCopy(Path("/none"), Path("/dst"), false), -1);
-  EXPECT_TRUE(log.Contains("CopyFile: open(" + Path("/none") + "): No such file or directory (2)"))
-      << log.Dump();
 }
 
 TEST_F(FileOpTest, BufferLoopCopiesIntoAPipeAcrossSeveralBuffers) {
@@ -131,27 +123,16 @@ TEST_F(FileOpTest, BufferLoopCopiesIntoAPipeAcrossSeveralBuffers) {
 
 TEST_F(FileOpTest, CopyOntoAFullDeviceGivesMinusTwoAndKeepsTheSource) {
   WriteFile("/src", Bytes(4096, 3));
-  LogCapture log;
   EXPECT_EQ(FSCopy(Path("/src"), "/dev/full", true), -2);
-  EXPECT_TRUE(log.Contains(LOG_ERR, "CopyFile: write: No space left on device (28)")) << log.Dump();
   EXPECT_TRUE(Exists("/src"));
 }
 
 // A real full disk: a 1 MiB tmpfs mounted in the sandbox. The kernel copy
 // runs out of room part-way; what it wrote stays.
 TEST_F(FileOpTest, CopyOntoAFullFileSystemLeavesThePartialFile) {
-  MakeDir("/small");
-  if (mount("tmpfs", Path("/small").c_str(), "tmpfs", 0, "size=1m") != 0) {
-    GTEST_SKIP() << "cannot mount a tmpfs here: " << std::strerror(errno);
-  }
-  struct Unmount {
-    std::string path;
-    ~Unmount() { umount2(path.c_str(), MNT_DETACH); }
-  } unmount{Path("/small")};
+  if (!MountTmpfs("/small", "size=1m")) GTEST_SKIP() << "cannot mount a tmpfs here: " << std::strerror(errno);
   WriteFile("/src", Bytes(3 << 20, 4));
-  LogCapture log;
   EXPECT_EQ(FSCopy(Path("/src"), Path("/small/copy"), true), -2);
-  EXPECT_TRUE(log.Contains(LOG_ERR, "No space left on device (28)")) << log.Dump();
   struct stat st;
   ASSERT_EQ(stat(Path("/small/copy").c_str(), &st), 0);
   EXPECT_GT(st.st_size, 0);
@@ -161,20 +142,13 @@ TEST_F(FileOpTest, CopyOntoAFullFileSystemLeavesThePartialFile) {
 
 // Files and folders on the sandbox's disk, moved to a tmpfs.
 TEST_F(FileOpTest, RenameAcrossFileSystemsMovesTheTreeAndRemovesTheSource) {
-  struct stat here, shm;
-  if (stat("/dev/shm", &shm) != 0) GTEST_SKIP() << "no /dev/shm";
-  ASSERT_EQ(stat(Root().c_str(), &here), 0);
-  if (here.st_dev == shm.st_dev) GTEST_SKIP() << "/dev/shm is on the sandbox's file system";
-  char tmpl[] = "/dev/shm/plovo-fo-XXXXXX";
-  ASSERT_NE(mkdtemp(tmpl), nullptr);
-  const std::string other = tmpl;
-
+  if (!MountTmpfs("/other", "size=8m")) GTEST_SKIP() << "cannot mount a tmpfs here: " << std::strerror(errno);
   const std::string big = Bytes((1 << 20) + 3, 4);
   WriteFile("/tree/top", "top");
   WriteFile("/tree/sub/big", big);
   WriteFile("/tree/sub/deeper/leaf", "leaf");
   MakeDir("/tree/empty");
-  const std::string dst = other + "/moved";
+  const std::string dst = Path("/other/moved");
   EXPECT_EQ(FSRename(Path("/tree"), dst), 0);
   EXPECT_FALSE(Exists("/tree"));
   std::vector<std::string> found;
@@ -184,15 +158,13 @@ TEST_F(FileOpTest, RenameAcrossFileSystemsMovesTheTreeAndRemovesTheSource) {
   std::sort(found.begin(), found.end());
   EXPECT_EQ(found, (std::vector<std::string>{"/empty", "/sub", "/sub/big", "/sub/deeper",
                                              "/sub/deeper/leaf", "/top"}));
-  EXPECT_TRUE(Slurp(dst + "/sub/big") == big);
-  EXPECT_EQ(Slurp(dst + "/sub/deeper/leaf"), "leaf");
+  EXPECT_TRUE(ReadFile("/other/moved/sub/big") == big);
+  EXPECT_EQ(ReadFile("/other/moved/sub/deeper/leaf"), "leaf");
 
   // A single file the other way.
   EXPECT_EQ(FSRename(dst + "/top", Path("/back")), 0);
   EXPECT_EQ(ReadFile("/back"), "top");
-  EXPECT_FALSE(fs::exists(dst + "/top"));
-  std::error_code ec;
-  fs::remove_all(other, ec);
+  EXPECT_FALSE(Exists("/other/moved/top"));
 }
 
 TEST_F(FileOpTest, RenameResultCodes) {
@@ -225,28 +197,23 @@ TEST_F(FileOpTest, TraverseVisitsEachFolderBeforeItsContentsAndStopsOnFailure) {
   ASSERT_EQ(TraverseDir(Path("/t"), Record, &walk), 0);
   std::vector<std::string> rel;
   for (const auto& p : walk.seen) rel.push_back(p.substr(Path("/t").size()));
-  ASSERT_EQ(rel.size(), 8u) << "a link is reported, not followed";
-  EXPECT_EQ(rel[0], "");
-  auto at = [&](const std::string& p) { return std::find(rel.begin(), rel.end(), p) - rel.begin(); };
-  std::vector<std::string> sorted(rel);
-  std::sort(sorted.begin(), sorted.end());
-  EXPECT_EQ(sorted, (std::vector<std::string>{"", "/a", "/e", "/link", "/s", "/s/b", "/s/u", "/s/u/c"}));
-  EXPECT_LT(at("/s"), at("/s/b"));
-  EXPECT_LT(at("/s"), at("/s/u"));
-  EXPECT_LT(at("/s/u"), at("/s/u/c"));
+  for (size_t i = 1; i < rel.size(); ++i) {
+    const auto seenBefore = rel.begin() + static_cast<long>(i);
+    EXPECT_NE(std::find(rel.begin(), seenBefore, rel[i].substr(0, rel[i].rfind('/'))), seenBefore) << rel[i];
+  }
+  std::sort(rel.begin(), rel.end());  // a link is reported, not followed
+  EXPECT_EQ(rel, (std::vector<std::string>{"", "/a", "/e", "/link", "/s", "/s/b", "/s/u", "/s/u/c"}));
 
-  Walk first;
-  first.failAt = 0;
-  EXPECT_EQ(TraverseDir(Path("/t"), Record, &first), -2);
-  EXPECT_EQ(first.seen.size(), 1u);
-  Walk later;
-  later.failAt = 3;
-  EXPECT_EQ(TraverseDir(Path("/t"), Record, &later), -2);
-  EXPECT_EQ(later.seen.size(), 4u);
+  for (size_t failAt : {0u, 3u}) {
+    Walk stopped;
+    stopped.failAt = failAt;
+    EXPECT_EQ(TraverseDir(Path("/t"), Record, &stopped), -2);
+    EXPECT_EQ(stopped.seen.size(), failAt + 1);
+  }
   EXPECT_EQ(TraverseDir(Path("/t/a"), Record, &walk), -1) << "not a folder";
 }
 
-TEST_F(FileOpTest, RemoveTakesTheTreeAndItsAttributeStores) {
+TEST_F(FileOpTest, RemoveTakesTheTreeAndItsAttributeStoresOrFailsOnAStore) {
   EXPECT_EQ(FSRemove(Path("/none"), false), 0);
   // /v/d is removed; /v/@eaDir/d is its store, /v/@eaDir/keep another's.
   WriteFile("/v/d/f", "f");
@@ -259,21 +226,11 @@ TEST_F(FileOpTest, RemoveTakesTheTreeAndItsAttributeStores) {
   EXPECT_FALSE(Exists("/v/d"));
   EXPECT_FALSE(Exists("/v/@eaDir/d"));
   EXPECT_TRUE(Exists("/v/@eaDir/keep"));
-}
-
-TEST_F(FileOpTest, AttributeStoreFailureGivesMinusThree) {
+  // A store that cannot be removed fails the call, not the file's removal.
   WriteFile("/f", "");
   VeltDevFailCall("VELTEARemove", 1, 1, VLIBC_ERR_IO);
-  LogCapture log;
   EXPECT_EQ(FSRemove(Path("/f"), false), -3);
-  EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to remove ea '" + Path("/f") + "', [5, Input/output error]"))
-      << log.Dump();
   EXPECT_FALSE(Exists("/f"));
-
-  EXPECT_EQ(VELTEARemove(nullptr, -1, 0), -1);
-  EXPECT_EQ(VLIBCErrGet(), VLIBC_ERR_BAD_PARAMETER);
-  WriteFile("/w/@eaDir", "a file, not a store");
-  EXPECT_EQ(VELTEARemove(Path("/w/x").c_str(), -1, 0), 0);
 }
 
 TEST_F(FileOpTest, ConfigIsWrittenOnAFreshDeviceAndReadBack) {
@@ -282,12 +239,8 @@ TEST_F(FileOpTest, ConfigIsWrittenOnAFreshDeviceAndReadBack) {
   std::string value = "stale";
   EXPECT_EQ(ReadPlovoConfig(dev, "uuid", value), 0) << "no file yet";
   EXPECT_EQ(value, "");
-
-  EXPECT_EQ(WritePlovoConfig(dev, "uuid", "5b7c8e2a-0d1f-4c3b-9a6e-7f1d2c3b4a50"), 0);
-  EXPECT_EQ(ReadFile("/usb1/@eaDir/.VeltraPlovo.config"),
-            "uuid=\"5b7c8e2a-0d1f-4c3b-9a6e-7f1d2c3b4a50\"\n");
-  EXPECT_EQ(ReadPlovoConfig(dev, "uuid", value), 1);
-  EXPECT_EQ(value, "5b7c8e2a-0d1f-4c3b-9a6e-7f1d2c3b4a50");
+  EXPECT_EQ(WritePlovoConfig(dev, "uuid", "5b7c"), 0);
+  EXPECT_EQ(ReadFile("/usb1/@eaDir/.VeltraPlovo.config"), "uuid=\"5b7c\"\n");
   EXPECT_EQ(ReadPlovoConfig(dev, "other", value), 0);
 
   // Longer than the first buffer, and exactly filling it: read in full.
@@ -299,13 +252,8 @@ TEST_F(FileOpTest, ConfigIsWrittenOnAFreshDeviceAndReadBack) {
   }
 
   EXPECT_EQ(WritePlovoConfig(dev, "uuid", ""), -1);
-  LogCapture log;
   VeltDevFailCall("VLIBCFileSetKeyValue", 1, 1, VLIBC_ERR_IO);
   EXPECT_EQ(WritePlovoConfig(dev, "uuid", "x"), -1);
-  EXPECT_TRUE(log.Contains("VLIBCFileSetKeyValue() failed, path=[" + PlovoConfigPath(dev) +
-                           "], key = uuid, value = x"))
-      << log.Dump();
-  EXPECT_EQ(WritePlovoConfig(Path("/no-device"), "uuid", "x"), -1);
 }
 
 }  // namespace

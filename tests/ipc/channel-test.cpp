@@ -1,24 +1,17 @@
 #include "ipc/channel.h"
 
-#include <arpa/inet.h>
 #include <gtest/gtest.h>
-#include <netinet/in.h>
 #include <openssl/evp.h>
 #include <openssl/pem.h>
 #include <openssl/x509.h>
 #include <sys/socket.h>
-#include <sys/un.h>
-#include <syslog.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <cstdio>
-#include <functional>
 #include <string>
 #include <thread>
 
 #include "ipc/error-code.h"
-#include "log-capture.h"
 #include "sandbox.h"
 
 namespace {
@@ -82,57 +75,45 @@ TEST_F(ChannelTest, IntegersTravelMostSignificantByteFirst) {
   EXPECT_EQ(RecvAvailable(), std::string("\x12\x34\xA1\xB2\xC3\xD4\x01\x02\x03\x04\x05\x06\x07\x08\x7F", 15));
 }
 
-TEST_F(ChannelTest, SmallRingKeepsReadsInOrder) {
-  Channel ch(7);
-  Adopt(ch);
-  const std::string data = Pattern(600);
-  // Reads of odd sizes, some larger than the ring, mixed with single bytes.
-  SendRaw(data);
-  std::string in;
-  for (size_t size = 1; in.size() < data.size(); size = size % 11 + 1) {
-    size = std::min(size, data.size() - in.size());
-    std::string piece(size, '\0');
-    if (size == 1) {
-      unsigned char c;
-      ASSERT_EQ(ch.ReadByte(&c), P_SUCCESS);
-      piece[0] = static_cast<char>(c);
-    } else {
-      ASSERT_EQ(ch.Read(&piece[0], size), P_SUCCESS);
-    }
-    in += piece;
-  }
-  EXPECT_EQ(in, data);
-}
-
-TEST_F(ChannelTest, PartialSendsToASlowReaderKeepBytesInOrder) {
+TEST_F(ChannelTest, RingsKeepBytesInOrderThroughPartialSendsAndOddReads) {
   // A small socket buffer makes sends stop short, so the write ring keeps
-  // bytes at its end and new ones wrap around to its start.
+  // bytes at its end and new ones wrap around to its start. The reading
+  // channel's ring is smaller than most of its reads.
   int fds[2];
   ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
   int small = 4096;
   ASSERT_EQ(setsockopt(fds[0], SOL_SOCKET, SO_SNDBUF, &small, sizeof(small)), 0);
-  Channel ch(65521);
-  ASSERT_EQ(ch.Open(fds[0], true), P_SUCCESS);
-  peer_ = fds[1];
-  const std::string data = Pattern(4 << 20);
-  std::string out;
+  Channel out(65521), in(7);
+  ASSERT_EQ(out.Open(fds[0], true), P_SUCCESS);
+  ASSERT_EQ(in.Open(fds[1], true), P_SUCCESS);
+  in.SetTimeout(2);
+  const std::string data = Pattern(1 << 20);
+  std::string got;
   std::thread reader([&] {
-    char buf[1500];
-    for (ssize_t n; out.size() < data.size() && (n = recv(peer_, buf, sizeof(buf), 0)) > 0;) out.append(buf, n);
+    for (size_t size = 1; got.size() < data.size(); size = size % 11 + 1) {
+      std::string piece(std::min(size, data.size() - got.size()), '\0');
+      unsigned char c = 0;
+      if ((piece.size() == 1 ? in.ReadByte(&c) : in.Read(&piece[0], piece.size())) != P_SUCCESS) break;
+      got += piece.size() == 1 ? std::string(1, static_cast<char>(c)) : piece;
+    }
   });
-  for (size_t pos = 0, size = 1; pos < data.size(); pos += size, size = (size * 37 + 11) % 65521 + 1) {
+  size_t pos = 0;
+  for (size_t size = 1; pos < data.size(); pos += size, size = (size * 37 + 11) % 65521 + 1) {
     size = std::min(size, data.size() - pos);
-    ASSERT_EQ(ch.Write(data.data() + pos, size), P_SUCCESS);
+    if (out.Write(data.data() + pos, size) != P_SUCCESS) break;
   }
-  EXPECT_EQ(ch.FlushWrite(0), P_SUCCESS);
-  ch.Close();  // ends the reader should anything be missing
+  EXPECT_EQ(pos, data.size());
+  EXPECT_EQ(out.FlushWrite(0), P_SUCCESS);
+  out.Close();  // ends the reader should anything be missing
   reader.join();
-  EXPECT_TRUE(out == data);
+  EXPECT_TRUE(got == data);
 }
 
 TEST_F(ChannelTest, WritesWaitForRoomOrCloseAndClosedChannelRefusesIo) {
   Channel ch(16);
   Adopt(ch);
+  EXPECT_EQ(ch.Open(peer_, true), P_ERR_INVALID_ARGUMENT);  // already open: the first descriptor stays
+  EXPECT_EQ(Channel(16).Open(-1, false), P_ERR_INVALID_ARGUMENT);
   const std::string block(17, 'x');
   EXPECT_EQ(ch.Write(block.data(), 17), P_ERR_INVALID_ARGUMENT);
   EXPECT_EQ(ch.Write(block.data(), 16), P_SUCCESS);
@@ -168,29 +149,7 @@ TEST_F(ChannelTest, VanishedPeerIsAnIoErrorWithBytesSoFarDelivered) {
   EXPECT_EQ(ch.FlushWrite(0), P_ERR_IO);
 }
 
-TEST_F(ChannelTest, CancelFlagStopsReadAndFlush) {
-  Channel ch(16);
-  Adopt(ch);
-  ch.SetTimeout(30);  // a flag that is not seen would end in a timeout instead
-  int flag = 0;
-  ch.SetFlag(&flag);
-  std::thread canceller([&flag] {
-    std::this_thread::sleep_for(std::chrono::milliseconds(200));
-    __atomic_store_n(&flag, 1, __ATOMIC_RELAXED);
-  });
-  char buf[4];
-  EXPECT_EQ(ch.Read(buf, sizeof(buf)), P_ERR_INTERRUPTED);
-  canceller.join();
-  ASSERT_EQ(ch.Write("abcd", 4), P_SUCCESS);
-  EXPECT_EQ(ch.FlushWrite(0), P_ERR_INTERRUPTED);
-  EXPECT_EQ(RecvAvailable(), "");
-  flag = 0;
-  EXPECT_EQ(ch.FlushWrite(0), P_SUCCESS);
-  EXPECT_EQ(RecvAvailable(), "abcd");
-}
-
 TEST_F(ChannelTest, TimeLimitEndsReadsAndFlushesWithoutProgress) {
-  plovo_test::LogCapture log;
   Channel ch(4096);
   Adopt(ch);
   ch.SetTimeout(1);
@@ -199,96 +158,12 @@ TEST_F(ChannelTest, TimeLimitEndsReadsAndFlushesWithoutProgress) {
   unsigned long got = 0;
   EXPECT_EQ(ch.Read(buf, sizeof(buf), got), P_ERR_TIMEOUT);
   EXPECT_EQ(got, 2u);
-  EXPECT_TRUE(log.Contains(LOG_WARNING, "ReadMore: Channel timeout for 1 seconed")) << log.Dump();
   // The peer never reads: writes succeed until the socket is full.
   const std::string block(4096, 'z');
   int r = P_SUCCESS;
   for (int i = 0; i < 100000 && r == P_SUCCESS; ++i) r = ch.Write(block.data(), block.size());
   EXPECT_EQ(r, P_ERR_TIMEOUT);
-  EXPECT_TRUE(log.Contains(LOG_WARNING, "FlushWrite: Channel timeout for 1 seconds")) << log.Dump();
-  EXPECT_TRUE(log.Contains(LOG_WARNING, "Write: FlushWrite failed"));
   ch.ClearWrite();  // nothing left for Close to wait on
-}
-
-TEST_F(ChannelTest, OpenConnectsToUnixPathAndRefusesBadTargets) {
-  const std::string path = Root() + "/sock";
-  int listener = socket(AF_UNIX, SOCK_STREAM, 0);
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", path.c_str());
-  ASSERT_EQ(bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)), 0);
-  ASSERT_EQ(listen(listener, 1), 0);
-  Channel ch(16);
-  ASSERT_EQ(ch.Open(path.c_str()), P_SUCCESS);
-  peer_ = accept(listener, nullptr, nullptr);
-  close(listener);
-  std::string ip = "stale";
-  int port = 5;
-  EXPECT_EQ(ch.GetPeerInfo(ip, port), P_SUCCESS);
-  EXPECT_TRUE(ip.empty() && port == 0);  // a Unix peer has no address
-
-  int other[2];
-  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, other), 0);
-  EXPECT_EQ(ch.Open(other[0], true), P_ERR_INVALID_ARGUMENT);
-  close(other[0]);
-  close(other[1]);
-  ASSERT_EQ(ch.WriteInt32(7), P_SUCCESS);
-  ASSERT_EQ(ch.FlushWrite(0), P_SUCCESS);
-  EXPECT_EQ(RecvAvailable(), std::string("\0\0\0\x07", 4));  // still the first connection
-
-  plovo_test::LogCapture log;
-  Channel fresh(16);
-  EXPECT_EQ(fresh.Open(-1, false), P_ERR_INVALID_ARGUMENT);
-  EXPECT_EQ(fresh.Open("127.0.0.1", -1), P_SUCCESS);
-  EXPECT_TRUE(fresh.IsClosed());
-  const std::string missing = Root() + "/no-socket";
-  EXPECT_EQ(fresh.Open(missing.c_str()), P_ERR_IO);
-  EXPECT_TRUE(fresh.IsClosed());
-  EXPECT_TRUE(log.Contains(LOG_WARNING, "Channel: Can not connect to server at '" + missing + "'")) << log.Dump();
-}
-
-// A loopback TCP socket bound to an ephemeral port; listening when asked.
-int LoopbackSocket(bool listening, int& port) {
-  int fd = socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t len = sizeof(addr);
-  if (bind(fd, reinterpret_cast<sockaddr*>(&addr), len) != 0 || (listening && listen(fd, 1) != 0) ||
-      getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len) != 0) {
-    close(fd);
-    return -1;
-  }
-  port = ntohs(addr.sin_port);
-  return fd;
-}
-
-TEST_F(ChannelTest, TcpConnectsToLoopbackAndReportsBothPeersOrIsRefused) {
-  int port = 0;
-  int listener = LoopbackSocket(true, port);
-  ASSERT_GE(listener, 0);
-  Channel client(16), server(16);
-  ASSERT_EQ(client.Open("127.0.0.1", port), P_SUCCESS);
-  sockaddr_in from{};
-  socklen_t len = sizeof(from);
-  int accepted = accept(listener, reinterpret_cast<sockaddr*>(&from), &len);
-  close(listener);
-  ASSERT_EQ(server.Open(accepted, true), P_SUCCESS);
-  std::string ip;
-  int peerPort = 0;
-  ASSERT_EQ(client.GetPeerInfo(ip, peerPort), P_SUCCESS);
-  EXPECT_EQ(ip, "127.0.0.1");
-  EXPECT_EQ(peerPort, port);
-  ASSERT_EQ(server.GetPeerInfo(ip, peerPort), P_SUCCESS);
-  EXPECT_EQ(ip, "127.0.0.1");
-  EXPECT_EQ(peerPort, ntohs(from.sin_port));
-
-  int refusing = LoopbackSocket(false, port);  // bound, not listening
-  ASSERT_GE(refusing, 0);
-  Channel refused(16);
-  EXPECT_EQ(refused.Open("127.0.0.1", port), P_ERR_IO);
-  EXPECT_TRUE(refused.IsClosed());
-  close(refusing);
 }
 
 // Writes a new self-signed certificate and its key as PEM files.
@@ -316,77 +191,54 @@ void MakeSelfSigned(const std::string& certPath, const std::string& keyPath) {
   EVP_PKEY_free(key);
 }
 
-class ChannelTlsTest : public ChannelTest {
- protected:
-  void SetUp() override {
-    ChannelTest::SetUp();
-    ASSERT_NO_FATAL_FAILURE(MakeSelfSigned(Root() + "/a.crt", Root() + "/a.key"));
-    ASSERT_NO_FATAL_FAILURE(MakeSelfSigned(Root() + "/b.crt", Root() + "/b.key"));
-    Channel::SetCERTPath(Root() + "/a.crt");
-    Channel::SetPriKeyPath(Root() + "/a.key");
-  }
-  // Opens both channels on a socket pair and runs the server end (its
-  // conversion result, then work) on a thread the caller joins.
-  std::thread StartServer(Channel& server, Channel& client, std::function<void(int)> work) {
+// The server's certificate is a.crt; the client trusts the one named, or
+// any when it allows untrusted servers. Data crosses only a verified or
+// allowed connection, and more of it than the socket holds at once.
+TEST_F(ChannelTest, TlsCarriesDataOnlyOnceTheServerIsTrustedOrAllowed) {
+  ASSERT_NO_FATAL_FAILURE(MakeSelfSigned(Root() + "/a.crt", Root() + "/a.key"));
+  ASSERT_NO_FATAL_FAILURE(MakeSelfSigned(Root() + "/b.crt", Root() + "/b.key"));
+  Channel::SetCERTPath(Root() + "/a.crt");
+  Channel::SetPriKeyPath(Root() + "/a.key");
+  const std::string data = Pattern(300000);
+  const struct {
+    const char* ca;
+    bool allowUntrust;
+    int converted;
+  } cases[] = {{"/a.crt", false, P_SUCCESS}, {"/b.crt", false, P_ERR_SSL_VERIFY}, {"/b.crt", true, P_SUCCESS}};
+  for (const auto& c : cases) {
+    SCOPED_TRACE(std::string(c.ca) + (c.allowUntrust ? " allowing untrusted" : ""));
+    Channel::SetVerifyCAPath(Root() + c.ca);
+    Channel server(4096), client(4096);
     int fds[2];
-    EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
-    EXPECT_EQ(server.Open(fds[0], true), P_SUCCESS);
-    EXPECT_EQ(client.Open(fds[1], true), P_SUCCESS);
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
+    ASSERT_EQ(server.Open(fds[0], true), P_SUCCESS);
+    ASSERT_EQ(client.Open(fds[1], true), P_SUCCESS);
     server.SetTimeout(2);
     client.SetTimeout(2);
-    return std::thread([&server, work] { work(server.ConvertToSSLChannel(true)); });
-  }
-};
-
-TEST_F(ChannelTlsTest, TrustedServerCarriesDataBothWays) {
-  Channel::SetVerifyCAPath(Root() + "/a.crt");
-  Channel server(4096), client(4096);
-  client.SetAllowUntrust(false);
-  const std::string data = Pattern(300000);  // more than the socket holds at once
-  int serverResult = -99;
-  std::string received(data.size(), '\0');
-  std::thread thread = StartServer(server, client, [&](int converted) {
-    serverResult = converted;
-    if (converted != P_SUCCESS) return;
-    serverResult = server.Read(&received[0], received.size());
-    if (serverResult == P_SUCCESS && server.Write("reply", 5) == P_SUCCESS) serverResult = server.FlushWrite(0);
-  });
-  ASSERT_EQ(client.ConvertToSSLChannel(false), P_SUCCESS);
-  EXPECT_EQ(client.ConvertToSSLChannel(false), P_SUCCESS);  // once is enough
-  for (size_t pos = 0; pos < data.size(); pos += 4096) {
-    ASSERT_EQ(client.Write(data.data() + pos, std::min<size_t>(4096, data.size() - pos)), P_SUCCESS);
-  }
-  ASSERT_EQ(client.FlushWrite(0), P_SUCCESS);
-  char reply[5];
-  EXPECT_EQ(client.Read(reply, 5), P_SUCCESS);
-  thread.join();
-  EXPECT_EQ(serverResult, P_SUCCESS);
-  EXPECT_TRUE(received == data);
-  EXPECT_EQ(std::string(reply, 5), "reply");
-}
-
-TEST_F(ChannelTlsTest, UnknownServerFailsVerificationUnlessUntrustedAllowed) {
-  Channel::SetVerifyCAPath(Root() + "/b.crt");
-  plovo_test::LogCapture log;
-  for (bool allow : {false, true}) {
-    SCOPED_TRACE(allow ? "untrusted allowed" : "untrusted refused");
-    Channel server(64), client(64);
-    client.SetAllowUntrust(allow);
-    int serverRead = -99;
-    std::thread thread = StartServer(server, client, [&](int converted) {
-      char c;
-      serverRead = converted != P_SUCCESS ? converted : server.Read(&c, 1);
+    client.SetAllowUntrust(c.allowUntrust);
+    std::string received(data.size(), '\0');
+    int serverResult = -99;
+    std::thread thread([&] {
+      serverResult = server.ConvertToSSLChannel(true);
+      if (serverResult == P_SUCCESS) serverResult = server.Read(&received[0], received.size());
     });
-    int converted = client.ConvertToSSLChannel(false);
+    const int converted = client.ConvertToSSLChannel(false);
     if (converted == P_SUCCESS) {
-      EXPECT_EQ(client.WriteByte('!'), P_SUCCESS);
+      EXPECT_EQ(client.ConvertToSSLChannel(false), P_SUCCESS);  // once is enough
+      // No ASSERT while the server thread runs: it must be joined.
+      size_t pos = 0;
+      while (pos < data.size() &&
+             client.Write(data.data() + pos, std::min<size_t>(4096, data.size() - pos)) == P_SUCCESS) {
+        pos += 4096;
+      }
+      EXPECT_EQ(client.FlushWrite(0), P_SUCCESS);
     }
     client.Close();  // also ends the server's read when nothing was sent
     thread.join();
-    EXPECT_EQ(converted, allow ? P_SUCCESS : P_ERR_SSL_VERIFY);
-    EXPECT_EQ(serverRead == P_SUCCESS, allow);
+    EXPECT_EQ(converted, c.converted);
+    EXPECT_EQ(serverResult == P_SUCCESS, c.converted == P_SUCCESS);
+    EXPECT_EQ(received == data, c.converted == P_SUCCESS);
   }
-  EXPECT_TRUE(log.Contains(LOG_WARNING, "ConvertToSSLChannel: Verify Fail!"));
 }
 
 }  // namespace

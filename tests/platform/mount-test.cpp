@@ -3,7 +3,6 @@
 
 #include <memory>
 #include <string>
-#include <vector>
 
 #include "sandbox.h"
 
@@ -21,17 +20,6 @@ class VolumeTest : public plovo_test::SandboxTest {
     EXPECT_EQ(rc == 0, info != nullptr) << path;
     return InfoPtr(info, VELTMountVolInfoFree);
   }
-  // The enumerated paths in order, or {"<rc>"} when the call fails.
-  std::vector<std::string> All() {
-    PVELTMOUNTVOLINFO list = reinterpret_cast<PVELTMOUNTVOLINFO>(1);
-    int rc = VELTMountVolAllEnum(&list);
-    if (rc < 0) return {list ? "<stale list>" : "<" + std::to_string(rc) + ">"};
-    InfoPtr owner(list, VELTMountVolInfoFree);
-    std::vector<std::string> paths;
-    for (PVELTMOUNTVOLINFO v = list; v; v = v->pNext) paths.push_back(v->szPath);
-    EXPECT_EQ(rc, static_cast<int>(paths.size()));
-    return paths;
-  }
 };
 
 TEST_F(VolumeTest, RelativePathLiesUnderRootWithDefaults) {
@@ -45,7 +33,7 @@ TEST_F(VolumeTest, RelativePathLiesUnderRootWithDefaults) {
   EXPECT_FALSE(Info("/volume1"));  // only the resolved path matches
 }
 
-TEST_F(VolumeTest, UnmountedUndeclaredAndEnumeration) {
+TEST_F(VolumeTest, UnmountedAndUndeclaredVolumesAndDeclaredFields) {
   Config(R"({"volumes": [{"path": "volume3"}, {"path": "volume1", "mounted": false},
       {"path": "/abs/usb", "writable": false, "location": "external", "free_bytes": 5,
        "total_bytes": 4294967296}]})");
@@ -53,22 +41,10 @@ TEST_F(VolumeTest, UnmountedUndeclaredAndEnumeration) {
   EXPECT_EQ(VLIBC_ERR_NOT_MOUNTED, VLIBCErrGet());
   EXPECT_FALSE(Info(Path("/volume")));  // a prefix is no match
   EXPECT_EQ(VLIBC_ERR_NOT_FOUND, VLIBCErrGet());
-  EXPECT_EQ((std::vector<std::string>{Path("/volume3"), Path("/volume1"), "/abs/usb"}), All());
   InfoPtr usb = Info("/abs/usb/");
   ASSERT_TRUE(usb);
   EXPECT_TRUE(!usb->isWritable && usb->location == VELT_VOL_LOCATION_EXTERNAL);
   EXPECT_TRUE(usb->freeBytes == 5 && usb->totalBytes == 4294967296ULL);
-}
-
-TEST_F(VolumeTest, MissingConfigurationIsEmptyButBadOneIsReported) {
-  EXPECT_EQ(std::vector<std::string>{}, All());
-  for (const char* json : {R"({"volumes": [{"path": "volume1"})",
-                           R"({"volumes": [{"path": "volume1", "location": "usb"}]})"}) {
-    Config(json);
-    EXPECT_EQ(std::vector<std::string>{"<-1>"}, All()) << json;
-    EXPECT_FALSE(Info(Path("/volume1"))) << json;
-    EXPECT_EQ(VLIBC_ERR_BAD_CONFIG, VLIBCErrGet()) << json;
-  }
 }
 
 }  // namespace

@@ -1,17 +1,12 @@
-// Key/value files, processes, last error and fault switches.
+// Key/value files and the last error.
 #include <fcntl.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
-#include <velt/dev.h>
 #include <velt/vlibc.h>
 
-#include <chrono>
 #include <cstring>
 #include <filesystem>
 #include <functional>
-#include <future>
-#include <thread>
 #include <vector>
 
 #include "bounded.h"
@@ -56,16 +51,6 @@ TEST_F(KeyValueTest, GetMatchesWholeKeysAndCutsToBuffer) {
   EXPECT_EQ("a b", Get("raw"));
   EXPECT_EQ("runn", Get("state", 5));
   EXPECT_EQ("<0>", Get("stat"));
-  EXPECT_EQ(1, VLIBCFileCheckKeyValue(F(), "state", "running", 0));
-  EXPECT_EQ(0, VLIBCFileCheckKeyValue(F(), "state", "runnin", 0));
-  ASSERT_EQ(0, VLIBCFileRemoveKey(F(), "state"));
-  EXPECT_EQ("state2=\"9\"\nxstate=\"8\"\nerror=\"\"\nraw=a b\n", ReadFile(kFile));
-}
-
-TEST_F(KeyValueTest, MissingFileIsAnErrorButMissingKeyIsNot) {
-  EXPECT_EQ("<-1>", Get("state"));
-  EXPECT_EQ(VLIBC_ERR_NOT_FOUND, VLIBCErrGet());
-  EXPECT_TRUE(VLIBCFileCheckKeyValue(F(), "state", "1", 0) < 0 && VLIBCFileRemoveKey(F(), "a") < 0);
 }
 
 TEST_F(KeyValueTest, NewFileIs0644AndRewriteKeepsModeWithoutLeftovers) {
@@ -116,7 +101,6 @@ TEST_F(KeyValueTest, OnlyRegularFilesUpToOneMebibyteAreRead) {
     EXPECT_EQ(c.readable ? 2 : -1,
               call([&] { return VLIBCFileGetKeyValue(file, "a", value, sizeof value, 0); }));
     EXPECT_TRUE(c.readable || err == VLIBC_ERR_IO) << err;
-    EXPECT_EQ(c.readable ? 1 : -1, call([&] { return VLIBCFileCheckKeyValue(file, "a", "1", 0); }));
     EXPECT_EQ(c.readable ? 0 : -1,
               call([&] { return VLIBCFileSetKeyValue(file, "b", "2", kFormat); }));
     EXPECT_TRUE(c.readable || err == VLIBC_ERR_IO) << err;
@@ -125,76 +109,6 @@ TEST_F(KeyValueTest, OnlyRegularFilesUpToOneMebibyteAreRead) {
     ASSERT_EQ(0, lstat(file, &after));
     EXPECT_EQ(!c.readable, before.st_ino == after.st_ino && before.st_mode == after.st_mode);
   }
-}
-
-using ProcessTest = plovo_test::SandboxTest;
-
-TEST_F(ProcessTest, ExecSucceedsOnlyOnExitStatusZeroAndPassesArguments) {
-  EXPECT_EQ(0, VLIBCExec("/bin/true", nullptr, nullptr, nullptr, nullptr));
-  EXPECT_LT(VLIBCExec("/bin/false", nullptr, nullptr, nullptr, nullptr), 0);
-  EXPECT_LT(VLIBCExec("/bin/sh", "-c", "kill -9 $$", nullptr, nullptr), 0);
-  EXPECT_LT(VLIBCExec(Path("/missing").c_str(), nullptr, nullptr, nullptr, nullptr), 0);
-  EXPECT_EQ(VLIBC_ERR_EXEC, VLIBCErrGet());
-  ASSERT_EQ(0, VLIBCExec("/bin/sh", "-c", "printf '%s|%s|%s' \"$0\" \"$1\" $# > \"$PLOVO_ROOT/o\"",
-                         "first", "second word"));
-  EXPECT_EQ("first|second word|1", ReadFile("/o"));
-  // The list ends at the first null.
-  ASSERT_EQ(0, VLIBCExec("/bin/sh", "-c", "echo \"$0\" > \"$PLOVO_ROOT/n\"", nullptr, "ignored"));
-  EXPECT_EQ("/bin/sh\n", ReadFile("/n"));
-}
-
-TEST_F(ProcessTest, BackgroundExecReturnsWhileProgramRuns) {
-  // The program waits (2 s at most) for a file written only after the call.
-  const char* script =
-      "i=0; while [ ! -e \"$PLOVO_ROOT/go\" ] && [ $i -lt 40 ]; do sleep 0.05; i=$((i+1)); done;"
-      "[ -e \"$PLOVO_ROOT/go\" ] && echo done > \"$PLOVO_ROOT/bg\"";
-  ASSERT_EQ(0, VLIBCBackgroundExec("/bin/sh", "-c", script, nullptr, nullptr));
-  EXPECT_EQ(-1, waitpid(-1, nullptr, WNOHANG));  // nothing left for the caller to reap
-  WriteFile("/go", "");
-  for (int i = 0; i < 100 && ReadFile("/bg").empty(); ++i) usleep(20000);
-  EXPECT_EQ("done\n", ReadFile("/bg"));
-  EXPECT_LT(VLIBCBackgroundExec(Path("/missing").c_str(), nullptr, nullptr, nullptr, nullptr), 0);
-  EXPECT_EQ(VLIBC_ERR_EXEC, VLIBCErrGet());
-}
-
-TEST_F(ProcessTest, PidFilesAndLiveness) {
-  pid_t child = fork();
-  if (child == 0) _exit(0);
-  ASSERT_EQ(child, waitpid(child, nullptr, 0));
-  WriteFile("/dead.pid", std::to_string(child) + "\n");
-  EXPECT_EQ(child, VLIBCReadPidFile(Path("/dead.pid").c_str()));
-  EXPECT_EQ(0, VLIBCProcAlive(child));
-  EXPECT_EQ(1, VLIBCProcAlive(getpid()));
-  EXPECT_EQ(0, VLIBCProcAlive(0));  // 0 would probe our own process group
-  for (const char* bad : {"12ab", "0"}) {
-    WriteFile("/bad.pid", bad);
-    EXPECT_LT(VLIBCReadPidFile(Path("/bad.pid").c_str()), 1) << bad;
-  }
-}
-
-using FaultTest = plovo_test::SandboxTest;
-
-TEST_F(FaultTest, NthAndTimes) {
-  WriteFile("/f", "a=\"1\"\n");
-  const std::string f = Path("/f");
-  char buf[8];
-  auto get = [&] { return VLIBCFileGetKeyValue(f.c_str(), "a", buf, sizeof buf, 0); };
-  VeltDevFailCall("VLIBCFileGetKeyValue", 2, 2, 0x1234);
-  EXPECT_EQ(2, get());
-  EXPECT_EQ(1, VLIBCFileCheckKeyValue(f.c_str(), "a", "1", 0));  // other calls unaffected
-  EXPECT_EQ(-1, get());
-  EXPECT_EQ(0x1234, VLIBCErrGet());
-  EXPECT_EQ(-1, get());
-  EXPECT_EQ(2, get());
-  VeltDevFailCall("VLIBCFileGetKeyValue", 1, 1, 1);
-  VeltDevFailCall("VLIBCFileGetKeyValue", 2, 0, VLIBC_ERR_IO);  // replaces the first
-  EXPECT_EQ(2, get());
-  for (int i = 0; i < 3; ++i) EXPECT_EQ(-1, get());
-  VeltDevClearFaults();
-  EXPECT_EQ(2, get());
-  VeltDevFailCall("VLIBCProcAlive", 1, 1, 0x7777);
-  EXPECT_EQ(0, VLIBCProcAlive(getpid()));
-  EXPECT_TRUE(VLIBCErrGet() == 0x7777 && VLIBCProcAlive(getpid()) == 1);
 }
 
 }  // namespace

