@@ -8,7 +8,6 @@
 #include "common/file-op.h"
 #include "sandbox.h"
 #include "velt/dev.h"
-#include "velt/storage.h"
 
 namespace {
 
@@ -26,24 +25,6 @@ class PlatformShareTest : public plovo_test::SandboxTest {
                   "devices": [{"producer": "Acme", "partitions": [{"share_name": "usbshare1"}], "port": 2}]})");
   }
 };
-
-TEST_F(PlatformShareTest, SharesAreFoundByNameWithTheirMountState) {
-  SDK::Share share;
-  ASSERT_EQ(share.open("usbshare1"), 0);
-  EXPECT_TRUE(share.isMounted());
-  EXPECT_EQ(share.getMountPoint(), Path("/usbshare1"));
-  ASSERT_EQ(share.open("usbshare2"), 0);
-  EXPECT_FALSE(share.isMounted());
-  EXPECT_EQ(share.getMountPoint(), "/mnt/x");
-  EXPECT_EQ(share.open("nosuch"), -1);
-  EXPECT_EQ(VLIBCErrGet(), VLIBC_ERR_NOT_FOUND);
-  EXPECT_FALSE(share.isMounted());
-  EXPECT_EQ(share.getMountPoint(), "");
-
-  WriteFile("/velt-dev/storage.json", R"({"shares": [{"name": "usbshare1", "mounted": "yes"}]})");
-  EXPECT_EQ(share.open("usbshare1"), -1);
-  EXPECT_EQ(VLIBCErrGet(), VLIBC_ERR_BAD_CONFIG);
-}
 
 TEST_F(PlatformShareTest, TheDeviceBehindAPathIsThatOfTheMountedShareHoldingIt) {
   std::string dev;
@@ -77,32 +58,6 @@ TEST_F(PlatformShareTest, IdentityComesFromTheFileSystemThenTheDeviceConfig) {
   VeltDevFailCall("VELTDevFsUuidGet", 1, 1, VLIBC_ERR_IO);
   ASSERT_EQ(SDK::GetUUID(Path("/usbshare1"), image, uuid), 0);
   EXPECT_EQ(uuid, "stored-id");
-}
-
-TEST(NewIdentity, IsARandomLowerCaseUuidText) {
-  const std::string a = SDK::GenerateUUID(), b = SDK::GenerateUUID();
-  EXPECT_NE(a, b);
-  ASSERT_EQ(a.size(), 36u);
-  EXPECT_EQ(a.find_first_not_of("0123456789abcdef-"), std::string::npos) << a;
-  EXPECT_EQ(a[14], '4') << a;  // version 4: random
-}
-
-TEST_F(PlatformShareTest, TheStorageServiceAnswersTheDeclaredDevices) {
-  Json::Value info;
-  ASSERT_EQ(VELT::QXS::STORAGE_WEBUTILS::Storage::GetUSBInfo(info), 0);
-  EXPECT_EQ(info["devices"][0]["producer"].asString(), "Acme");
-  EXPECT_EQ(info["devices"][0]["port"].asInt(), 2);
-  EXPECT_EQ(info["devices"][0]["partitions"][0]["share_name"].asString(), "usbshare1");
-
-  unlink(Path("/velt-dev/storage.json").c_str());
-  ASSERT_EQ(VELT::QXS::STORAGE_WEBUTILS::Storage::GetUSBInfo(info), 0);
-  EXPECT_TRUE(info["devices"].isArray());
-  EXPECT_EQ(info["devices"].size(), 0u);
-
-  WriteFile("/velt-dev/storage.json", "{\"devices\": [");
-  EXPECT_EQ(VELT::QXS::STORAGE_WEBUTILS::Storage::GetUSBInfo(info), -1);
-  EXPECT_EQ(VLIBCErrGet(), VLIBC_ERR_BAD_CONFIG);
-  EXPECT_TRUE(info.isNull());
 }
 
 }  // namespace

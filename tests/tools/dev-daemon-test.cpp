@@ -1,6 +1,5 @@
 // plovod-dev, the development daemon, run as its own process in a sandbox
-// and driven through plovo-api as the README shows, plus what plovo-api
-// cannot reach: an unknown action and the ways to end it.
+// and driven through plovo-api as the README shows.
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <signal.h>
@@ -13,7 +12,6 @@
 #include <thread>
 
 #include "common/paths.h"
-#include "ipc/daemon-ipc.h"
 #include "sandbox.h"
 
 namespace {
@@ -23,7 +21,10 @@ using namespace std::chrono_literals;
 class DevDaemonTest : public plovo_test::SandboxTest {
  protected:
   void TearDown() override {
-    if (pid_ > 0) Stop(SIGKILL);
+    if (pid_ > 0) {
+      kill(pid_, SIGKILL);
+      waitpid(pid_, nullptr, 0);
+    }
     SandboxTest::TearDown();
   }
   // Starts the daemon, its stderr in the sandbox, and waits for its socket
@@ -42,19 +43,6 @@ class DevDaemonTest : public plovo_test::SandboxTest {
     }
     FAIL() << "no socket; " << ReadFile("/daemon.log");
   }
-  // Signals the daemon (0: none) and returns its exit status once it has
-  // ended; -1 when killed or still running after five seconds.
-  int Stop(int signal) {
-    if (signal != 0) kill(pid_, signal);
-    int status = 0, waits = 0;
-    while (waitpid(pid_, &status, WNOHANG) == 0 && ++waits < 250) std::this_thread::sleep_for(20ms);
-    if (waits == 250) {
-      kill(pid_, SIGKILL);
-      waitpid(pid_, nullptr, 0);
-    }
-    pid_ = -1;
-    return waits < 250 && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-  }
   // What plovo-api prints: the answer as compact JSON.
   std::string Api(const std::string& method, const std::string& params) {
     const std::string command = "PLOVO_ROOT=" + Root() + " " + PLOVO_API_PATH + " " + method + " '" +
@@ -69,26 +57,6 @@ class DevDaemonTest : public plovo_test::SandboxTest {
 
   pid_t pid_ = -1;
 };
-
-TEST_F(DevDaemonTest, RefusesUnknownActionsAndEndsOnStopOrSignal) {
-  Start();
-  PObject request, answer;
-  request["action"] = "format_usb";
-  EXPECT_EQ(DaemonIPC().SendCommand(request, answer), -1);
-  EXPECT_EQ(answer["error_code"].asInt64(), 1);
-  request["action"] = "stop";
-  request["need_ack"] = 0;
-  EXPECT_EQ(DaemonIPC().SendCommand(request, answer), 0);
-  EXPECT_EQ(Stop(0), 0);
-  EXPECT_FALSE(Exists("/tmp/plovo-socket"));
-
-  WriteFile("/tmp/plovo-socket", "stale");  // replaced by the next start
-  for (int signal : {SIGTERM, SIGINT}) {
-    Start();
-    EXPECT_EQ(Stop(signal), 0) << signal;
-    EXPECT_FALSE(Exists("/tmp/plovo-socket")) << signal;
-  }
-}
 
 // The round trip the README shows, step by step (what each answer holds),
 // and the daemon's lines for the refusals.
