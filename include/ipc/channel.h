@@ -26,10 +26,9 @@
 // Binary interface: code compiled separately against this class (a
 // subclass, another program's build of it) depends on its layout, so some
 // members are here for their place rather than for a use in this module.
-// Every virtual
-// function is a slot, declared in slot order from the destructor to
-// SwitchChannelOp: add none, drop none, reorder none, and keep new members
-// non-virtual (as SetDeadline and Capacity are). The fields from m_handle to
+// Every virtual function is a slot, declared in slot order from the
+// destructor to SwitchChannelOp: add none, drop none, reorder none, and keep
+// new members non-virtual (as SetDeadline and Capacity are). The fields from m_handle to
 // m_allow_untrust keep their order and types; new fields go after them. The
 // static certificate paths are named data of the interface. Members marked
 // "binary interface" below have no other reason to exist: Convert has no
