@@ -7,13 +7,10 @@
 
 // ---- CommandServer::Connection ----------------------------------------------
 
-CommandServer::Connection::~Connection() {
-  if (!m_adopted) close(m_fd);
-}
-
 bool CommandServer::Connection::Adopt() {
   if (m_adopted) return true;
   if (m_sender.assign(m_fd) != 0) return false;
+  m_owned.release();
   m_adopted = true;
   m_sender.channel().SetDeadline(kTimeLimit);
   return true;

@@ -36,6 +36,7 @@
 #include <thread>
 #include <vector>
 
+#include "common/unique-fd.h"
 #include "ipc/pobject.h"
 #include "ipc/simple-ipc.h"
 
@@ -50,8 +51,7 @@ class CommandServer {
   // One accepted connection. The server closes it when the hook returns.
   class Connection {
    public:
-    explicit Connection(int fd) : m_fd(fd) {}
-    ~Connection();
+    explicit Connection(int fd) : m_fd(fd), m_owned(fd) {}
     Connection(const Connection&) = delete;
     Connection& operator=(const Connection&) = delete;
 
@@ -67,6 +67,7 @@ class CommandServer {
     bool Adopt();
 
     int m_fd;
+    Plovo::UniqueFd m_owned;  // until the channel takes the socket over
     bool m_adopted = false;
     IPCSender m_sender;
   };
