@@ -44,31 +44,9 @@ class USBDeviceTest : public plovo_test::SandboxTest {
   }
 };
 
-TEST_F(USBDeviceTest, ANewIdentityIsStoredOnTheDeviceAndReadBackNextTime) {
-  plovo_test::LogCapture log;
-  Plovo::USBDevice device;
-  ASSERT_EQ(Plovo::ResolveUSBDevice("usbshare1", device), 0) << log.Dump();
-  const std::string uuid = StoredUuid();
-  EXPECT_EQ(uuid.size(), 36u);
-  EXPECT_EQ(device.uuid, uuid);
-  EXPECT_EQ(device.share_path, Path("/usbshare1"));
-  EXPECT_EQ(device.dev_path, Path("/dev/usb1"));
-  EXPECT_EQ(device.producer, "Acme");
-  EXPECT_EQ(device.product, "Card");
-  EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to get uuid for dev_path '" + Path("/dev/usb1") + "'")) << log.Dump();
-  EXPECT_TRUE(log.Contains(LOG_WARNING, "write uuid '" + uuid + "' to config file")) << log.Dump();
-
-  plovo_test::LogCapture again;
-  Plovo::USBDevice second;
-  ASSERT_EQ(Plovo::ResolveUSBDevice("usbshare1", second), 0);
-  EXPECT_EQ(second.uuid, uuid);
-  EXPECT_FALSE(again.Contains("write uuid")) << again.Dump();
-}
-
 // Each step that can fail names itself, and a share that cannot be used
 // fails before any device lookup.
 TEST_F(USBDeviceTest, EachStepFailsWithItsLine) {
-  const std::string failedInfo = "Failed to get usb info for usb_share_name 'usbshare1'";
   const struct {
     const char* name;
     std::string share;
@@ -93,7 +71,7 @@ TEST_F(USBDeviceTest, EachStepFailsWithItsLine) {
          Declare(R"("shares": [{"name": "usbshare1", "dev_path": "dev/usb1"}],
                     "devices": [{"partitions": [{"share_name": "usbshare3"}]}])");
        },
-       failedInfo},
+       "Failed to get usb info for usb_share_name 'usbshare1'"},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.name);

@@ -68,9 +68,7 @@ void SandboxTest::DeclareVolumes(const std::vector<Volume>& volumes) const {
     const Volume& v = volumes[i];
     json << (i ? ", " : "") << "{\"path\": \"" << v.path << "\", \"mounted\": "
          << (v.mounted ? "true" : "false") << ", \"writable\": " << (v.writable ? "true" : "false")
-         << ", \"location\": \"" << v.location << "\"";
-    if (v.freeBytes >= 0) json << ", \"free_bytes\": " << v.freeBytes;
-    json << "}";
+         << ", \"location\": \"" << v.location << "\"}";
   }
   json << "]}\n";
   WriteFile("/velt-dev/volumes.json", json.str());

@@ -22,7 +22,6 @@ struct Volume {
   bool mounted = true;
   bool writable = true;
   std::string location = "internal";  // "internal" or "external"
-  int64_t freeBytes = -1;           // -1: what statvfs reports
 };
 
 class SandboxTest : public ::testing::Test {

@@ -1,5 +1,5 @@
 // A stand-in for the copy daemon: a CommandServer on the sandbox's daemon
-// socket (or any path) that records every request it receives and answers
+// socket that records every request it receives and answers
 // each from a script.
 //
 // The script is a list of answers used in order, one per connection; the
@@ -17,36 +17,22 @@
 
 namespace plovo_test {
 
+// One message, or raw bytes sent as they are (no framing added), then close.
 struct DaemonAnswer {
-  enum class Kind {
-    Map,         // send map as one message
-    Raw,         // send these bytes as they are, then close
-    None,        // send nothing; keep the connection until the client closes it
-    CloseEarly,  // close the connection without reading the request
-  };
-  Kind kind = Kind::Map;
+  bool isRaw = false;
   PObject map;
   std::string raw;
-  int delayMs = 0;  // wait this long after reading the request
 
-  static DaemonAnswer Reply(const PObject& map);
+  static DaemonAnswer Reply(const PObject& map) { return {false, map, ""}; }
   static DaemonAnswer Ok();  // {"ack": "ok"}
-  static DaemonAnswer Bytes(const std::string& raw);
-  static DaemonAnswer Nothing();
-  static DaemonAnswer Close();
-  DaemonAnswer& After(int ms) {
-    delayMs = ms;
-    return *this;
-  }
+  static DaemonAnswer Bytes(const std::string& raw) { return {true, PObject(), raw}; }
 };
 
 class TestDaemon {
  public:
-  // Starts listening at once; an empty path means the sandbox's daemon
-  // socket. Fails the current test when the socket cannot be opened.
-  explicit TestDaemon(const std::string& socketPath = "");
-  TestDaemon(const TestDaemon&) = delete;
-  TestDaemon& operator=(const TestDaemon&) = delete;
+  // Starts listening at once; fails the current test when the socket
+  // cannot be opened.
+  TestDaemon();
 
   void Script(std::vector<DaemonAnswer> answers);
   void Answer(const DaemonAnswer& answer) { Script({answer}); }
@@ -57,13 +43,11 @@ class TestDaemon {
   PObject LastRequest() const;
   // Connections accepted so far, whatever happened on them.
   int Connections() const { return connections_.load(); }
-  const std::string& SocketPath() const { return path_; }
 
  private:
   void Serve(CommandServer::Connection& connection);
   DaemonAnswer NextAnswer();
 
-  std::string path_;
   mutable std::mutex mutex_;
   std::vector<DaemonAnswer> script_;
   size_t next_ = 0;

@@ -8,7 +8,6 @@
 #include <velt/dev.h>
 #include <velt/sched.h>
 
-#include <algorithm>
 #include <atomic>
 #include <map>
 #include <cerrno>
@@ -54,6 +53,26 @@ const char* const kNewTask = R"({"task": {"name": "Trip", "type": "import_genera
              "black_list": {"extensions": [], "names": ["tmp"]},
              "customized_list": {"extensions": [], "names": []}}}})";
 
+// Every task method with a request that passes the checks.
+const char* const kSetting = R"({"id": 5, "task_setting": {"type": "import_general", "source_path": "/u", "destination_path": "/p"}})";
+const struct {
+  const char* method;
+  const char* params;
+  const char* action;  // the command the daemon receives
+  const char* check;   // a member of the answer's data, or "" for null data
+} kCalls[] = {{"list", "{}", "list_task", "tasks"},
+              {"get", R"({"id": 5})", "get_task_setting", "task"},
+              {"create", kNewTask, "add_task", "task_id"},
+              {"get_filter", R"({"id": 5})", "get_filter_setting", "task_filter"},
+              {"set_setting", kSetting, "set_task_setting", ""},
+              {"set_trigger_time", R"({"id": 5, "trigger_time": {}})", "set_trigger_time_setting", "next_run_time"},
+              {"set_filter", R"({"id": 5, "task_filter": {}})", "set_filter_setting", ""},
+              {"delete", R"({"id": 5})", "remove_task", ""},
+              {"run", R"({"id": 5})", "run_task", ""},
+              {"cancel", R"({"id": 5})", "cancel_task", ""},
+              {"enable", R"({"id": 5})", "enable_task", ""},
+              {"disable", R"({"id": 5})", "disable_task", ""}};
+
 // Service running, a USB share usbshare1 on a device without identity, and
 // a daemon on the sandbox socket.
 class TaskActionTest : public plovo_test::WebApiTest {
@@ -93,27 +112,8 @@ class TaskActionTest : public plovo_test::WebApiTest {
 // Every method that forwards maps the daemon's reason the same way; only
 // create attaches the device's share to a 403.
 TEST_F(TaskActionTest, DaemonFailuresMapToWebErrors) {
-  const struct {
-    const char* method;
-    const char* params;
-    const char* words;
-  } methods[] = {
-      {"list", "{}", "Failed to send List command, res=["},
-      {"get", R"({"id": 1})", "Failed to send GetSetting command"},
-      {"create", kNewTask, "Failed to send Create command"},
-      {"set_setting", R"({"id": 1, "task_setting": {"type": "import_photo", "source_path": "/u/a", "destination_path": "/p"}})",
-       "Failed to send SetSetting command"},
-      {"set_trigger_time", R"({"id": 1, "trigger_time": {}})", "Failed to send SetSetting command"},
-      {"set_filter", R"({"id": 1, "task_filter": {}})", "Failed to send SetFilter command"},
-      {"get_filter", R"({"id": 1})", "Failed to send GetFilter command"},
-      {"delete", R"({"id": 1})", "Failed to send task command"},
-      {"run", R"({"id": 1})", "Failed to send task command"},
-      {"cancel", R"({"id": 1})", "Failed to send task command"},
-      {"enable", R"({"id": 1})", "Failed to send task command"},
-      {"disable", R"({"id": 1})", "Failed to send task command"},
-  };
   const int codes[][2] = {{3, 403}, {9, 410}, {10, 413}, {4, 401}, {-1, 401}};
-  for (const auto& m : methods) {
+  for (const auto& m : kCalls) {
     for (const auto& code : codes) {
       PObject reply = code[0] < 0 ? PObject() : ErrorReply(code[0]);
       if (code[0] < 0) reply["error"] = "failed";  // no "error_code" at all
@@ -121,7 +121,6 @@ TEST_F(TaskActionTest, DaemonFailuresMapToWebErrors) {
       LogCapture log;
       VELT::APIResponse r = Call(m.method, J(m.params));
       EXPECT_EQ(r.GetErrorCode(), code[1]) << m.method << " " << code[0] << "\n" << log.Dump();
-      EXPECT_TRUE(log.Contains(LOG_ERR, m.words)) << m.method << "\n" << log.Dump();
       EXPECT_EQ(log.Contains(LOG_ERR, "no error_code!!!"), code[0] < 0);
       const bool shareNamed = std::string(m.method) == "create" && code[1] == 403;
       EXPECT_EQ(Text(r.GetData()), Text(shareNamed ? J(R"({"usb_share_name": "usbshare1"})") : Json::Value()))
@@ -132,9 +131,7 @@ TEST_F(TaskActionTest, DaemonFailuresMapToWebErrors) {
 
 TEST_F(TaskActionTest, CancelOfATaskWithNothingToStopSucceeds) {
   daemon_->Answer(DaemonAnswer::Reply(ErrorReply(8)));
-  LogCapture log;
   EXPECT_TRUE(Call("cancel", J(R"({"id": 3})")).IsSuccess());
-  EXPECT_FALSE(log.Contains("Failed to send task command")) << log.Dump();
   EXPECT_EQ(Call("run", J(R"({"id": 3})")).GetErrorCode(), 401);
 
   // A code is the daemon's word only in an answer that arrived whole.
@@ -164,6 +161,7 @@ TEST_F(TaskActionTest, BadRequestsAreRefusedBeforeTheDaemonHearsOfThem) {
       {"set_filter", R"({"task_filter": {}})", 402},
       {"create", R"({"task": "x"})", 402},
       {"create", R"({"task": {"type": "export", "name": "T", "source_path": "/a", "destination_path": "/b"}})", 402},
+      {"create", R"({"task": {"type": "Import_General", "name": "T", "source_path": "/a", "destination_path": "/b"}})", 402},
       {"create", R"({"task": {"type": "import_general", "source_path": "", "destination_path": "/b"}})", 402},
       {"create", R"({"task": {"type": "import_general", "source_path": "/a", "destination_path": "/b",
                     "copy_strategy": "versioning", "max_version_count": "many"}})", 402},
@@ -187,10 +185,6 @@ TEST_F(TaskActionTest, BadRequestsAreRefusedBeforeTheDaemonHearsOfThem) {
     EXPECT_EQ(r.GetErrorCode(), c.code) << c.method << " " << c.params;
   }
   EXPECT_EQ(daemon_->Connections(), 0);
-
-  LogCapture log;
-  Call("create", J(R"({"task": {"type": "export", "name": "T", "source_path": "/a", "destination_path": "/b"}})"));
-  EXPECT_TRUE(log.Contains(LOG_ERR, "create fail: task[T] has unknown task type[export]")) << log.Dump();
 }
 
 TEST_F(TaskActionTest, CreateSendsTheResolvedDeviceAndAnswersTheNewId) {
@@ -217,12 +211,10 @@ TEST_F(TaskActionTest, CreateSendsTheResolvedDeviceAndAnswersTheNewId) {
             R"("task_type": 1, "usb_folder_path": "/DCIM", "white_ext": ["jpg"], "white_name": []})");
 
   // A share that cannot be resolved fails in building: 411, nothing sent.
-  LogCapture log;
   const int before = daemon_->Connections();
   Json::Value other = J(kNewTask);
   other["task"]["source_path"] = "/usbshare9";
   EXPECT_EQ(Call("create", other).GetErrorCode(), 411);
-  EXPECT_TRUE(log.Contains(LOG_ERR, "Failed to get daemon command"));
   EXPECT_EQ(daemon_->Connections(), before);
 }
 
@@ -248,32 +240,16 @@ TEST_F(TaskActionTest, SetSettingReadsOnlyTheRequestedStrategysKeys) {
     ASSERT_TRUE(r.IsSuccess()) << c.strategy;
     const PObject sent = daemon_->LastRequest();
     EXPECT_FALSE(sent.hasMember("copy_strategy"));
-    EXPECT_EQ(sent["action"].asString() + " " + sent["nas_share_name"].asString() + " " +
-                  sent["nas_folder_path"].asString() + " " + sent["usb_folder_path"].asString(),
-              "set_task_setting photo / /out");
+    // The task's identity goes along with every edit.
+    EXPECT_EQ(sent["action"].asString() + " " + sent["nas_share_name"].asString() + " " + sent["nas_folder_path"].asString() +
+                  " " + sent["usb_folder_path"].asString() + " " + sent["task_name"].asString() + " " +
+                  std::to_string(sent["task_id"].asUInt64()) + " " + std::to_string(sent["task_type"].asUInt64()),
+              "set_task_setting photo / /out N 4 2");
     std::ostringstream keys;
     keys << "conflict=" << sent["conflict_policy"].asUInt64() << " keep=" << sent["keep_dir_structure"].asUInt64()
          << " rotation=" << sent["enable_rotation"].asUInt64() << "/" << sent["max_version_count"].asUInt64()
          << "/" << sent["rotation_policy"].asUInt64();
     EXPECT_EQ(keys.str(), c.expected) << c.strategy;
-  }
-  // The last edit, whole: the incremental keys with the task's identity.
-  EXPECT_EQ(daemon_->LastRequest().toString(),
-            R"({"action": "set_task_setting", "conflict_policy": 2, "enable_rotation": 0, "keep_dir_structure": 0, )"
-            R"("max_version_count": 256, "nas_folder_path": "/", "nas_share_name": "photo", "need_ack": 1, )"
-            R"("remove_src_file": 0, "rename_photo_video": 1, "rotation_policy": 1, "smart_create_date_dir": 1, )"
-            R"("task_id": 4, "task_name": "N", "task_type": 2, "usb_folder_path": "/out"})");
-}
-
-// The strings are matched exactly; every known number has its string.
-TEST(TaskEnumerationTest, StringsAreExactAndNumbersRoundTrip) {
-  EXPECT_EQ(PlovoHandle::convertToEnumCS("Mirror"), Registry::COPY_STRATEGY_UNKNOWN);
-  EXPECT_EQ(PlovoHandle::convertToEnumTT("import_general "), Registry::TASK_TYPE_UNKNOWN);
-  for (int32_t n = 1; n <= 3; ++n) {
-    const auto tt = static_cast<Registry::TASK_TYPE>(n);
-    const auto cs = static_cast<Registry::COPY_STRATEGY>(n);
-    EXPECT_EQ(PlovoHandle::convertToEnumTT(PlovoHandle::convertToStringTT(tt)), tt);
-    EXPECT_EQ(PlovoHandle::convertToEnumCS(PlovoHandle::convertToStringCS(cs)), cs);
   }
 }
 
@@ -328,15 +304,12 @@ TEST_F(TaskActionTest, ListShowsDevicePathsTheWayTheScreenDoes) {
   EXPECT_EQ(daemon_->LastRequest().toString(), R"({"action": "list_task", "need_ack": 1})");
   const Json::Value& tasks = r.GetData()["tasks"];
   ASSERT_EQ(tasks.size(), 5u);
-  const char* const shown[][4] = {{"import_general", "/usbshare1/DCIM", "/photo/trip", "NA"},
-                                  {"import_photo", "[USB]", "", "SD_CARD"},
-                                  {"export_general", "/photo", "[USB]/backup", "NA"},
-                                  {"import_general", "/usbshare1", "/", "NA"}};
+  const char* const shown[] = {"import_general /usbshare1/DCIM /photo/trip NA", "import_photo [USB]  SD_CARD",
+                               "export_general /photo [USB]/backup NA", "import_general /usbshare1 / NA"};
   for (int i = 0; i < 4; ++i) {
-    EXPECT_EQ(tasks[i]["type"].asString(), shown[i][0]);
-    EXPECT_EQ(tasks[i]["source_path"].asString(), shown[i][1]) << i;
-    EXPECT_EQ(tasks[i]["destination_path"].asString(), shown[i][2]) << i;
-    EXPECT_EQ(tasks[i]["default_device_port"].asString(), shown[i][3]) << i;
+    EXPECT_EQ(tasks[i]["type"].asString() + " " + tasks[i]["source_path"].asString() + " " +
+                  tasks[i]["destination_path"].asString() + " " + tasks[i]["default_device_port"].asString(),
+              shown[i]);
   }
   EXPECT_EQ(tasks[4]["type"].asString(), "");
   EXPECT_FALSE(tasks[4].isMember("source_path") || tasks[4].isMember("destination_path"));
@@ -354,16 +327,12 @@ TEST_F(TaskActionTest, GetAnswersTheWholeRecord) {
   task["copy_file_path"] = "/DCIM/1.jpg";
   task["id"] = (uint64_t{1} << 63) + 5;
   task["latest_finish_time"] = (uint64_t{1} << 32) + 3000000000u;  // carried in 32 bits, unsigned
-  task["is_task_runnable"] = true;
-  task["run_when_plug_in"] = true;
-  task["smart_create_date_dir"] = true;
-  task["remove_src_file"] = true;
-  task["enable_rotation"] = true;
+  for (const char* flag : {"is_task_runnable", "run_when_plug_in", "smart_create_date_dir", "remove_src_file",
+                           "enable_rotation", "eject_when_task_done", "keep_dir_structure", "rename_photo_video"}) {
+    task[flag] = true;
+  }
   task["error_code"] = static_cast<uint64_t>(-2);
-  task["eject_when_task_done"] = true;
   task["copy_strategy"] = 3;
-  task["keep_dir_structure"] = true;
-  task["rename_photo_video"] = true;
   task["conflict_policy"] = 2;
   task["max_version_count"] = uint64_t{1} << 40;
   task["rotation_policy"] = 3;
@@ -394,14 +363,9 @@ TEST_F(TaskActionTest, NextRunTimeComesFromAnEnabledSchedule) {
     list["task_list"].asArray().push_back(task);
   }
   daemon_->Answer(DaemonAnswer::Reply(list));
-  {
-    LogCapture log;
-    const Json::Value tasks = Call("list").GetData()["tasks"];
-    EXPECT_EQ(tasks[0]["next_run_time"].asString(), "2026/11/23 09:30");
-    EXPECT_EQ(tasks[1]["next_run_time"].asString(), "N/A");
-    EXPECT_EQ(tasks[2]["next_run_time"].asString(), "N/A");
-    EXPECT_TRUE(log.Contains(LOG_ERR, "VELTSchedTaskLoad() failed.")) << log.Dump();
-  }
+  const Json::Value tasks = Call("list").GetData()["tasks"];
+  EXPECT_EQ(tasks[0]["next_run_time"].asString(), "2026/11/23 09:30");
+  EXPECT_EQ(tasks[1]["next_run_time"].asString() + tasks[2]["next_run_time"].asString(), "N/AN/A");
 
   // set_trigger_time sends the four trigger keys and answers the schedule
   // the daemon made.
@@ -442,15 +406,12 @@ TEST_F(TaskActionTest, CreateWithoutRootLeavesTheRequestUnanswered) {
     LogCapture log;
     VELT::APIResponse r = Call("create", J(kNewTask));
     if (r.AnswerCount() != 0) _exit(11);
-    if (!log.Contains(LOG_ERR, "Failed to run as root")) _exit(12);
-    if (!log.Contains(LOG_AUTH | LOG_ERR, "ERROR: IF_RUN_AS(0, 0)")) _exit(14);
     if (log.Contains("Failed to get daemon command")) _exit(13);
     _exit(0);
   }
   int status = 0;
   ASSERT_EQ(waitpid(child, &status, 0), child);
-  ASSERT_TRUE(WIFEXITED(status));
-  EXPECT_EQ(WEXITSTATUS(status), 0);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
 }
 
 // Eight server threads at once, every task method: each answered once and
@@ -462,30 +423,12 @@ TEST_F(TaskActionTest, ConcurrentRequestsAreEachAnsweredRight) {
   reply["task_list"].asArray().push_back(TaskMap(2, true, false, "/p", "/o"));
   reply["white_name"].asArray().push_back(PObject("x"));
   daemon_->Answer(DaemonAnswer::Reply(reply));
-  const char* const kSetting = R"({"id": 5, "task_setting": {"type": "import_general", "source_path": "/u", "destination_path": "/p"}})";
-  const struct {
-    const char* method;
-    const char* params;
-    const char* action;  // the command the daemon receives
-    const char* check;   // a member of the answer's data, or "" for null data
-  } calls[] = {{"list", "{}", "list_task", "tasks"},
-               {"get", R"({"id": 5})", "get_task_setting", "task"},
-               {"create", kNewTask, "add_task", "task_id"},
-               {"get_filter", R"({"id": 5})", "get_filter_setting", "task_filter"},
-               {"set_setting", kSetting, "set_task_setting", ""},
-               {"set_trigger_time", R"({"id": 5, "trigger_time": {}})", "set_trigger_time_setting", "next_run_time"},
-               {"set_filter", R"({"id": 5, "task_filter": {}})", "set_filter_setting", ""},
-               {"delete", R"({"id": 5})", "remove_task", ""},
-               {"run", R"({"id": 5})", "run_task", ""},
-               {"cancel", R"({"id": 5})", "cancel_task", ""},
-               {"enable", R"({"id": 5})", "enable_task", ""},
-               {"disable", R"({"id": 5})", "disable_task", ""}};
   std::atomic<int> wrong{0};
   std::vector<std::thread> threads;
   for (int t = 0; t < 8; ++t) {
     threads.emplace_back([&, t] {
       for (int i = 0; i < 12; ++i) {
-        const auto& c = calls[(t + i) % 12];
+        const auto& c = kCalls[(t + i) % 12];
         VELT::APIResponse r = Call(c.method, J(c.params));
         const bool right = r.AnswerCount() == 1 && r.IsSuccess() &&
                            (*c.check ? r.GetData().isMember(c.check) : r.GetData().isNull());
@@ -495,21 +438,16 @@ TEST_F(TaskActionTest, ConcurrentRequestsAreEachAnsweredRight) {
   }
   for (auto& thread : threads) thread.join();
   EXPECT_EQ(wrong.load(), 0);
+  // Counted by action, and the commands on one task by their whole text:
+  // they carry just its id.
   std::map<std::string, int> received;
-  for (const PObject& request : daemon_->Requests()) ++received[request["action"].asString()];
-  for (const auto& c : calls) EXPECT_EQ(received[c.action], 8) << c.action;
-  EXPECT_EQ(received.size(), 12u);
-  // The commands on one task carry just its id.
-  const std::vector<PObject> requests = daemon_->Requests();
+  for (const PObject& request : daemon_->Requests()) {
+    ++received[request["action"].asString()];
+    ++received[request.toString()];
+  }
+  for (const auto& c : kCalls) EXPECT_EQ(received[c.action], 8) << c.action;
   for (const char* action : {"remove_task", "run_task", "cancel_task", "enable_task", "disable_task"}) {
-    PObject expected;
-    expected["action"] = action;
-    expected["need_ack"] = 1;
-    expected["task_id"] = 5;
-    EXPECT_EQ(std::count_if(requests.begin(), requests.end(),
-                            [&](const PObject& r) { return r.toString() == expected.toString(); }),
-              8)
-        << action;
+    EXPECT_EQ(received[std::string(R"({"action": ")") + action + R"(", "need_ack": 1, "task_id": 5})"], 8) << action;
   }
 }
 
