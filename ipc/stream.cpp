@@ -57,6 +57,11 @@ void PStream::SetHistoryTop(std::string_view key) {
   m_history.back() = key;
 }
 
+void PStream::PrependHistory(std::string_view key) {
+  std::lock_guard<std::mutex> lock(m_mutex);
+  m_history.insert(m_history.begin(), key);
+}
+
 void PStream::PopHistory() {
   std::lock_guard<std::mutex> lock(m_mutex);
   if (!m_history.empty()) m_history.pop_back();
@@ -129,7 +134,7 @@ int PStream::Send(Channel& ch, const PObject& value) {
 
 // Everything that can make a value unsendable without the peer's doing is
 // found here, so that a refused value puts no byte on the wire. The key
-// path of the offending value stays on the stack for DumpHistory.
+// path of the offending value is left on the stack for DumpHistory.
 int PStream::CheckSendable(const PObject& value, uint64_t depth) {
   if (value.isString()) {
     // A longer string cannot state its length in 16 bits; the peer would
@@ -170,18 +175,23 @@ int PStream::CheckSendable(const PObject& value, uint64_t depth) {
     }
     return 0;
   }
-  PushHistory();
   for (const auto& [key, member] : value.asMap()) {
     std::string_view wireKey = key;
     if (!wireKey.empty() && wireKey[0] == '_') wireKey.remove_prefix(1);
-    SetHistoryTop(wireKey);
+    int r = 0;
     if (wireKey.size() > kMaxString) {
       PLOVO_LIB_ERR("PStream: key of %zu bytes exceeds %zu", wireKey.size(), kMaxString);
-      return P_ERR_INVALID_ARGUMENT;
+      r = P_ERR_INVALID_ARGUMENT;
+    } else {
+      r = CheckSendable(member, depth + 1);
     }
-    if (int r = CheckSendable(member, depth + 1); r != 0) return r;
+    if (r != 0) {
+      // The path is built on the way out, from the failing key up, so that
+      // a value that passes costs no lock per key.
+      PrependHistory(wireKey);
+      return r;
+    }
   }
-  PopHistory();
   return 0;
 }
 

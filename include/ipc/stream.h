@@ -135,6 +135,7 @@ class PStream {
   void PushHistory();
   void SetHistoryTop(std::string_view key);
   void PopHistory();
+  void PrependHistory(std::string_view key);
   std::string JoinHistory() const;  // caller holds m_mutex
   std::string Indent() const;
   bool TooDeep() const;
