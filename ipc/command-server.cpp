@@ -5,6 +5,8 @@
 
 #include <utility>
 
+#include "common/no-throw.h"
+
 // ---- CommandServer::Connection ----------------------------------------------
 
 bool CommandServer::Connection::Adopt() {
@@ -74,7 +76,8 @@ int CommandServer::NextConnection() {
 void CommandServer::Work() {
   for (int fd; (fd = NextConnection()) >= 0;) {
     Connection connection(fd);
-    m_hook(connection);
+    // One broken request must not take the daemon down with it.
+    Plovo::NoThrow([&] { m_hook(connection); return true; }, false);
     // Before the connection closes the socket: Stop must not shut down a
     // descriptor number that the process has meanwhile given to another file.
     std::lock_guard<std::mutex> lock(m_mutex);

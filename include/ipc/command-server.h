@@ -21,9 +21,10 @@
 // Results: Start returns 0 or -1 (the listener logs why). Ownership: the
 // server owns the listening socket, every accepted connection and the
 // threads; Stop and the destructor close and join them all and remove the
-// socket file. Threads: handlers and hooks run on the connection threads,
-// several at once, so what they share needs a lock; they must not call
-// Stop. Start and Stop are called by the owner's thread.
+// socket file. An exception that escapes a handler or hook is logged and
+// ends that connection only. Threads: handlers and hooks run on the worker
+// threads, several at once, so what they share needs a lock; they must not
+// call Stop. Start and Stop are called by the owner's thread.
 #ifndef PLOVO_IPC_COMMAND_SERVER_H
 #define PLOVO_IPC_COMMAND_SERVER_H
 

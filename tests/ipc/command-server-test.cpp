@@ -10,6 +10,7 @@
 #include <condition_variable>
 #include <future>
 #include <mutex>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
@@ -51,7 +52,8 @@ TEST_F(CommandServerTest, AnswersByTheTableOrTheFallback) {
     };
   };
   std::vector<std::string> problems;
-  CommandServer server({{"echo", answer("echo")}, {"quiet", answer(nullptr)}}, answer("unknown"),
+  auto broken = [](const PObject&) -> PObject { throw std::runtime_error("broken handler"); };
+  CommandServer server({{"echo", answer("echo")}, {"quiet", answer(nullptr)}, {"broken", broken}}, answer("unknown"),
                        [&](const std::string& problem) { problems.push_back(problem); });
   ASSERT_EQ(server.Start(Plovo::Path::DaemonSocket()), 0);
   // A client that hangs up without a request; accepted before the ones below.
@@ -64,6 +66,7 @@ TEST_F(CommandServerTest, AnswersByTheTableOrTheFallback) {
   } rows[] = {
       {"echo", -1, R"({"echo": "echo"})"}, {"echo", 1, R"({"echo": "echo"})"}, {"echo", 0, "none"},
       {"format", -1, R"({"unknown": "format"})"}, {"format", 0, "none"}, {"quiet", -1, "none"},
+      {"broken", -1, "none"}, {"echo", -1, R"({"echo": "echo"})"},
   };
   for (const auto& row : rows) {
     PObject request = Map("action", row.action);
@@ -73,7 +76,7 @@ TEST_F(CommandServerTest, AnswersByTheTableOrTheFallback) {
   server.Stop();  // joins the connections, so what they left is read safely here
   // Answered or not, every request reached its handler; the hang-up is
   // reported.
-  EXPECT_EQ(calls, 6);
+  EXPECT_EQ(calls, 7);
   EXPECT_EQ(problems, std::vector<std::string>{"unreadable request"});
 }
 
