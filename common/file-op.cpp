@@ -263,8 +263,10 @@ int FSMKDir(const std::string& path, bool recursive, unsigned uid, unsigned gid)
       if (!recursive) {  // FSMKDirP names the step that failed itself
         int err = errno;
         // Another caller made it since the look above: it is there, and
-        // its owner is that caller's to set.
-        if (err == EEXIST && IsFolder(path)) return 0;
+        // its owner is that caller's to set. Looked at without following a
+        // link, as above: a link put there meanwhile is no folder.
+        struct stat st;
+        if (err == EEXIST && lstat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) return 0;
         PLOVO_LIB_ERR("FSMKDir: mkdir(%s): %s (%d)",
                       path.c_str(), Plovo::ErrorText(err).c_str(), err);
       }

@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <filesystem>
 #include <functional>
 #include <thread>
 #include <vector>
@@ -30,6 +31,7 @@ class USBDeviceTest : public plovo_test::SandboxTest {
     SandboxTest::SetUp();
     MakeDir("/usbshare1");
     MakeDir("/usbshare2");
+    MakeDir("/elsewhere");
     WriteFile("/dev/usb1", "");
     Declare(R"("shares": [{"name": "usbshare1", "dev_path": "dev/usb1"},
                           {"name": "usbshare2", "mounted": false, "dev_path": "dev/usb1"}],
@@ -61,6 +63,9 @@ TEST_F(USBDeviceTest, EachStepFailsWithItsLine) {
       // "@eaDir" is in the way as a plain file.
       {"identity not stored", "usbshare1", [this] { WriteFile("/usbshare1/@eaDir", ""); },
        "Failed to write Plovo config '" + Path("/usbshare1") + "', uuid '"},
+      // A link planted on the device must not carry a root write elsewhere.
+      {"folder is a link", "usbshare1", [this] { symlink(Path("/elsewhere").c_str(), Path("/usbshare1/@eaDir").c_str()); },
+       "Failed to write Plovo config '" + Path("/usbshare1") + "', uuid '"},
       {"storage service fails", "usbshare1", [] { VeltDevFailCall("GetUSBInfo", 1, 1, VLIBC_ERR_IO); },
        "Failed to get all usb data"},
       {"storage answer without a device list", "usbshare1",
@@ -84,6 +89,7 @@ TEST_F(USBDeviceTest, EachStepFailsWithItsLine) {
     EXPECT_TRUE(log.Contains(LOG_ERR, c.line)) << log.Dump();
   }
   EXPECT_FALSE(Exists("/usbshare2/@eaDir"));
+  EXPECT_TRUE(std::filesystem::is_empty(Path("/elsewhere")));
 }
 
 // Concurrent creators on a device without identity must agree on one, the
