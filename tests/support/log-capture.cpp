@@ -5,17 +5,17 @@
 namespace plovo_test {
 
 LogCapture::LogCapture() {
-  Plovo::SetLogSink([this](int priority, const std::string& line) {
-    std::lock_guard<std::mutex> lock(mutex_);
-    lines_.push_back({priority, line});
+  Plovo::SetLogSink([state = state_](int priority, const std::string& line) {
+    std::lock_guard<std::mutex> lock(state->mutex);
+    state->lines.push_back({priority, line});
   });
 }
 
 LogCapture::~LogCapture() { Plovo::SetLogSink(nullptr); }
 
 std::vector<LogCapture::Line> LogCapture::Lines() const {
-  std::lock_guard<std::mutex> lock(mutex_);
-  return lines_;
+  std::lock_guard<std::mutex> lock(state_->mutex);
+  return state_->lines;
 }
 
 bool LogCapture::Contains(const std::string& text) const {

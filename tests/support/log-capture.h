@@ -3,6 +3,7 @@
 #ifndef PLOVO_TESTS_SUPPORT_LOG_CAPTURE_H
 #define PLOVO_TESTS_SUPPORT_LOG_CAPTURE_H
 
+#include <memory>
 #include <mutex>
 #include <string>
 #include <vector>
@@ -30,8 +31,13 @@ class LogCapture {
   std::string Dump() const;
 
  private:
-  mutable std::mutex mutex_;
-  std::vector<Line> lines_;
+  // Shared with the sink: a line another thread is still writing when the
+  // capture ends lands here rather than in a destroyed object.
+  struct State {
+    std::mutex mutex;
+    std::vector<Line> lines;
+  };
+  std::shared_ptr<State> state_ = std::make_shared<State>();
 };
 
 }  // namespace plovo_test
