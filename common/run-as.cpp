@@ -1,37 +1,24 @@
 #include "common/run-as.h"
 
+#include <sys/syscall.h>
 #include <unistd.h>
-
-#include <mutex>
 
 namespace Plovo {
 namespace {
 
-// The ids the process had before the first living guard raised them.
-struct Raised {
-  std::mutex mutex;
-  int guards = 0;
-  uid_t uid = 0;
-  gid_t gid = 0;
-};
-
-Raised& SharedRecord() {
-  static Raised record;
-  return record;
-}
+// The raw system calls change the calling thread's credentials only. The C
+// library's setresuid and setresgid would change every thread of the
+// process, signalling each one and waiting for it.
+bool SetThreadEffectiveUid(uid_t uid) { return syscall(SYS_setresuid, -1, uid, -1) == 0; }
+bool SetThreadEffectiveGid(gid_t gid) { return syscall(SYS_setresgid, -1, gid, -1) == 0; }
 
 }  // namespace
 
-RunAsRoot::RunAsRoot(const char* file, int line) : file_(file), line_(line) {
-  Raised& raised = SharedRecord();
-  std::lock_guard<std::mutex> lock(raised.mutex);
-  if (raised.guards++ == 0) {
-    raised.uid = geteuid();
-    raised.gid = getegid();
-    if (geteuid() != 0) setresuid(-1, 0, -1);
-    if (getegid() != 0) setresgid(-1, 0, -1);
-    if (geteuid() != 0) setresuid(-1, 0, -1);
-  }
+RunAsRoot::RunAsRoot(const char* file, int line)
+    : file_(file), line_(line), uid_(geteuid()), gid_(getegid()) {
+  if (geteuid() != 0) SetThreadEffectiveUid(0);
+  if (getegid() != 0) SetThreadEffectiveGid(0);
+  if (geteuid() != 0) SetThreadEffectiveUid(0);
   ok_ = geteuid() == 0 && getegid() == 0;
   if (!ok_) {
     LogWrite(LOG_AUTH | LOG_ERR, "%s:%d ERROR: %s(%d, %d)", file_, line_, "IF_RUN_AS", 0, 0);
@@ -39,21 +26,18 @@ RunAsRoot::RunAsRoot(const char* file, int line) : file_(file), line_(line) {
 }
 
 RunAsRoot::~RunAsRoot() {
-  Raised& raised = SharedRecord();
-  std::lock_guard<std::mutex> lock(raised.mutex);
-  if (--raised.guards > 0) return;
   bool good = true;
-  if (getegid() != raised.gid) {
+  if (getegid() != gid_) {
     // Only root may set the group back.
-    if (geteuid() != 0 && setresuid(-1, 0, -1) != 0) good = false;
-    if (setresgid(-1, raised.gid, -1) != 0) good = false;
+    if (geteuid() != 0 && !SetThreadEffectiveUid(0)) good = false;
+    if (!SetThreadEffectiveGid(gid_)) good = false;
   }
   // The user is restored even when the group could not be, so that a
-  // failure never leaves the process as root.
-  if (geteuid() != raised.uid && setresuid(-1, raised.uid, -1) != 0) good = false;
+  // failure never leaves the thread as root.
+  if (geteuid() != uid_ && !SetThreadEffectiveUid(uid_)) good = false;
   if (!good) {
     LogWrite(LOG_AUTH | LOG_CRIT, "%s:%d ERROR: ~%s(%d, %d)", file_, line_, "IF_RUN_AS",
-             static_cast<int>(raised.uid), static_cast<int>(raised.gid));
+             static_cast<int>(uid_), static_cast<int>(gid_));
   }
 }
 

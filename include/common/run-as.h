@@ -7,13 +7,20 @@
 // the module changes ids. The real and saved ids are never touched, so
 // dropping back is always possible.
 //
-// Ids belong to the whole process, and the server runs requests on several
-// threads. The guards therefore share one record: the first guard to start
-// remembers the ids and raises, the last one to end restores them. While any
-// guard lives, every thread of the process runs as root, so keep scopes
-// short.
+// The ids are changed for the calling thread only. The kernel keeps
+// credentials per thread; the C library's set*id functions make every
+// thread of the process follow, by signalling each one and waiting for it.
+// The web server runs requests on several threads, so a process-wide change
+// would let every other request run as root while one holds a guard, and
+// would cost each raise and each restore a round of signals to every
+// thread. Each guard therefore remembers its own thread's ids and restores
+// only them; guards on different threads never see each other. A thread
+// that starts another while it holds a guard hands root to the new thread,
+// so do no such thing inside a guard's scope.
 #ifndef PLOVO_COMMON_RUN_AS_H
 #define PLOVO_COMMON_RUN_AS_H
+
+#include <sys/types.h>
 
 #include "common/log.h"
 
@@ -27,7 +34,7 @@ class RunAsRoot {
   // at LOG_AUTH | LOG_ERR with the guard's own file and line; ok() then
   // answers false.
   RunAsRoot(const char* file, int line);
-  // The last guard to end restores the remembered ids, group first. A
+  // Restores the ids the thread had when the guard began, group first. A
   // failure is logged at LOG_AUTH | LOG_CRIT as
   // "<file>:<line> ERROR: ~IF_RUN_AS(uid, gid)" with the ids it restores.
   ~RunAsRoot();
@@ -39,6 +46,8 @@ class RunAsRoot {
  private:
   const char* file_;
   int line_;
+  uid_t uid_;
+  gid_t gid_;
   bool ok_ = false;
 };
 
