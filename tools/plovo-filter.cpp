@@ -1,0 +1,79 @@
+// plovo-filter: shows how a task's filter file reads and what it does to a
+// path, for a support engineer asking why a file was or was not copied.
+//
+//   plovo-filter print black|white FILE
+//     Parses FILE with the list's schema (the parser's warnings and errors
+//     go where it prints them) and, when it reads (0 or 1), prints the
+//     record back on stdout. Exit status: the parse result, 0, 1 or 2.
+//   plovo-filter test black|white FILE PATH [--dir]
+//     Parses FILE (exit 2 when it does not read), then prints the result of
+//     the black-list path test or the white-list test for PATH (a folder
+//     with --dir) as one decimal line, and exits 0.
+//
+// Wrong usage prints the usage line on stderr and exits 64.
+#include <cstdio>
+#include <cstring>
+
+#include "filter/filter-match.h"
+#include "filter/filter.h"
+
+namespace {
+
+constexpr int kUsageStatus = 64;
+
+int Usage() {
+  fputs("usage: plovo-filter print black|white FILE | plovo-filter test black|white FILE PATH [--dir]\n", stderr);
+  return kUsageStatus;
+}
+
+int Print(bool black, const char* file) {
+  int result = 0;
+  if (black) {
+    black_list_filter filter;
+    filter_init(&filter);
+    result = filter_read(file, &filter);
+    if (result != 2) filter_print(stdout, &filter);
+    filter_destroy(&filter);
+  } else {
+    white_list list;
+    white_list_init(&list);
+    result = white_list_read(file, &list);
+    if (result != 2) white_list_print(stdout, &list);
+    white_list_destroy(&list);
+  }
+  return result;
+}
+
+int Test(bool black, const char* file, const char* path, bool isDirectory) {
+  int result = 0;
+  if (black) {
+    black_list_filter filter;
+    filter_init(&filter);
+    const bool read = filter_read(file, &filter) != 2;
+    if (read) result = filter_test_path(&filter, path, isDirectory);
+    filter_destroy(&filter);
+    if (!read) return 2;
+  } else {
+    white_list list;
+    white_list_init(&list);
+    const bool read = white_list_read(file, &list) != 2;
+    if (read) result = white_list_test(&list, path, isDirectory);
+    white_list_destroy(&list);
+    if (!read) return 2;
+  }
+  printf("%d\n", result);
+  return 0;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  if (argc < 4) return Usage();
+  const bool black = strcmp(argv[2], "black") == 0;
+  if (!black && strcmp(argv[2], "white") != 0) return Usage();
+  if (strcmp(argv[1], "print") == 0 && argc == 4) return Print(black, argv[3]);
+  if (strcmp(argv[1], "test") == 0 && (argc == 5 || (argc == 6 && strcmp(argv[5], "--dir") == 0))) {
+    return Test(black, argv[3], argv[4], argc == 6);
+  }
+  return Usage();
+}
