@@ -11,4 +11,3 @@ void PlovoHandle::NotAvailableYet(const char* action) {
 
 void PlovoHandle::GetGlobalSetting() { NotAvailableYet(__func__); }
 void PlovoHandle::SetGlobalSetting() { NotAvailableYet(__func__); }
-void PlovoHandle::GetLogList() { NotAvailableYet(__func__); }

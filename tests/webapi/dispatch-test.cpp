@@ -55,7 +55,7 @@ TEST_F(DispatchTest, EachListedMethodReachesItsOwnAction) {
       {"disable", "disable_task"},
       {"get_global_setting", "Action GetGlobalSetting is not available yet"},
       {"set_global_setting", "Action SetGlobalSetting is not available yet"},
-      {"get_log_list", "Action GetLogList is not available yet"}};
+      {"get_log_list", "Failed to get limit"}};
   for (const auto& [method, evidence] : rows) {
     LogCapture log;
     const int before = daemon.Connections();
