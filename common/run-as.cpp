@@ -16,10 +16,12 @@ bool SetThreadEffectiveGid(gid_t gid) { return syscall(SYS_setresgid, -1, gid, -
 
 RunAsRoot::RunAsRoot(const char* file, int line)
     : file_(file), line_(line), uid_(geteuid()), gid_(getegid()) {
-  if (geteuid() != 0) SetThreadEffectiveUid(0);
-  if (getegid() != 0) SetThreadEffectiveGid(0);
-  if (geteuid() != 0) SetThreadEffectiveUid(0);
-  ok_ = geteuid() == 0 && getegid() == 0;
+  // A change that succeeded is known to hold, so the ids are read once.
+  bool userRoot = uid_ == 0, groupRoot = gid_ == 0;
+  if (!userRoot) userRoot = SetThreadEffectiveUid(0);
+  if (!groupRoot) groupRoot = SetThreadEffectiveGid(0);
+  if (!userRoot) userRoot = SetThreadEffectiveUid(0);
+  ok_ = userRoot && groupRoot;
   if (!ok_) {
     LogWrite(LOG_AUTH | LOG_ERR, "%s:%d ERROR: %s(%d, %d)", file_, line_, "IF_RUN_AS", 0, 0);
   }

@@ -8,7 +8,7 @@
 #include <type_traits>
 #include <utility>
 
-static_assert(sizeof(PObject) == 2 * sizeof(void*), "a PObject is a tag and a pointer");
+static_assert(sizeof(PObject) == 2 * sizeof(void*), "a PObject is a tag and one word of payload");
 
 const PObject PObject::empty_object;
 const PObject::array_type PObject::empty_array;
@@ -93,11 +93,11 @@ void PObject::buffer_type::clear() {
 
 PObject::PObject(const char* s) : PObject() { reset(std::string(s)); }
 PObject::PObject(const std::string& s) : PObject() { reset(s); }
-PObject::PObject(uint64_t n) : PObject() { reset(n); }
+PObject::PObject(uint64_t n) noexcept : PObject() { setInteger(n); }
 PObject::PObject(const buffer_type& b) : PObject() { reset(b); }
 PObject::PObject(const PObject& other) : PObject() { copy(other); }
 
-PObject::PObject(PObject&& other) noexcept : type_(other.type_), data_(other.data_) {
+PObject::PObject(PObject&& other) noexcept : type_(other.type_), number_(other.number_) {
   other.type_ = kNull;
   other.data_ = nullptr;
 }
@@ -109,6 +109,13 @@ PObject& PObject::reset(T&& value) {
   clear();
   type_ = type_trait<V>::value;
   data_ = payload;
+  return *this;
+}
+
+PObject& PObject::setInteger(uint64_t n) noexcept {
+  clear();
+  type_ = kInteger;
+  number_ = n;
   return *this;
 }
 
@@ -136,11 +143,11 @@ PObject& PObject::operator=(const buffer_type& b) { return reset(b); }
 PObject& PObject::operator=(const binary_type& b) { return reset(b); }
 PObject& PObject::operator=(const array_type& a) { return reset(a); }
 PObject& PObject::operator=(const map_type& m) { return reset(m); }
-PObject& PObject::operator=(int n) { return reset(static_cast<uint64_t>(static_cast<int64_t>(n))); }
-PObject& PObject::operator=(unsigned int n) { return reset(static_cast<uint64_t>(n)); }
-PObject& PObject::operator=(bool b) { return reset(static_cast<uint64_t>(b ? 1 : 0)); }
-PObject& PObject::operator=(long n) { return reset(static_cast<uint64_t>(static_cast<int64_t>(n))); }
-PObject& PObject::operator=(unsigned long n) { return reset(static_cast<uint64_t>(n)); }
+PObject& PObject::operator=(int n) { return setInteger(static_cast<uint64_t>(static_cast<int64_t>(n))); }
+PObject& PObject::operator=(unsigned int n) { return setInteger(n); }
+PObject& PObject::operator=(bool b) { return setInteger(b ? 1 : 0); }
+PObject& PObject::operator=(long n) { return setInteger(static_cast<uint64_t>(static_cast<int64_t>(n))); }
+PObject& PObject::operator=(unsigned long n) { return setInteger(n); }
 
 void PObject::copy(const PObject& other) {
   if (this == &other) {
@@ -153,7 +160,7 @@ void PObject::copy(const PObject& other) {
   switch (other.type_) {
     case kArray: result.reset(*static_cast<const array_type*>(other.data_)); break;
     case kMap: result.reset(*static_cast<const map_type*>(other.data_)); break;
-    case kInteger: result.reset(*static_cast<const uint64_t*>(other.data_)); break;
+    case kInteger: result.setInteger(other.number_); break;
     case kString: result.reset(*static_cast<const std::string*>(other.data_)); break;
     case kBinary: result.reset(*static_cast<const binary_type*>(other.data_)); break;
     case kBuffer: result.reset(*static_cast<const buffer_type*>(other.data_)); break;
@@ -164,14 +171,13 @@ void PObject::copy(const PObject& other) {
 
 void PObject::swap(PObject& other) noexcept {
   std::swap(type_, other.type_);
-  std::swap(data_, other.data_);
+  std::swap(number_, other.number_);
 }
 
 void PObject::clear() noexcept {
   switch (type_) {
     case kArray: delete static_cast<array_type*>(data_); break;
     case kMap: delete static_cast<map_type*>(data_); break;
-    case kInteger: delete static_cast<uint64_t*>(data_); break;
     case kString: delete static_cast<std::string*>(data_); break;
     case kBinary: delete static_cast<binary_type*>(data_); break;
     case kBuffer: delete static_cast<buffer_type*>(data_); break;
@@ -200,7 +206,7 @@ bool PObject::hasMember(const std::string& key) const {
 }
 
 uint64_t PObject::asUInt64() const {
-  return isInteger() ? *static_cast<const uint64_t*>(data_) : 0;
+  return isInteger() ? number_ : 0;
 }
 
 bool PObject::asBool() const {

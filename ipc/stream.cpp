@@ -415,16 +415,22 @@ int PStream::Recv(Channel& ch, std::string& text) {
   unsigned short length = 0;
   int ret = ch.ReadInt16(&length);
   if (ret == 0 && !Charge(length)) return P_ERR_INVALID_ARGUMENT;
-  if (ret == 0) {
+  // The text ends at its first zero byte, as the peer's C strings do.
+  if (ret == 0 && length <= kShortString) {
+    // Most texts are keys and short values: read them on the stack and
+    // build the string once, at its final length.
+    char bytes[kShortString];
+    ret = ch.Read(bytes, length);
+    if (ret == 0) text.assign(bytes, strnlen(bytes, length));
+  } else if (ret == 0) {
     text.resize(length);
     // Read in blocks: a channel reads at most its capacity at a time.
     for (size_t at = 0; ret == 0 && at < length; at += kBlockSize) {
       ret = ch.Read(&text[at], std::min<size_t>(length - at, kBlockSize));
     }
+    if (ret == 0) text.resize(strnlen(text.c_str(), length));
   }
   if (ret != 0) return ChannelFailure(ret);
-  // The text ends at its first zero byte, as the peer's C strings do.
-  text.resize(strnlen(text.c_str(), length));
   if (m_trace) PLOVO_LIB_DBG("%s\"%s\"", Indent().c_str(), text.c_str());
   return 0;
 }

@@ -6,9 +6,11 @@
 // wire serialiser relies on:
 //   0 null, 1 array, 2 map (byte-wise key order), 3 unsigned 64-bit
 //   integer, 4 string, 5 binary (a file section), 6 buffer (raw bytes).
-// The object is two words: the tag and a pointer to a heap payload that it
-// owns (null for the null value). Every assignment releases the old
-// payload; the destructor releases it too. Containers own their elements.
+// The object is two words: the tag and the payload word. An integer is
+// kept in the payload word itself; every other kind has a heap payload that
+// the object owns and the word points to (the null value has none). Every
+// assignment releases the old payload; the destructor releases it too.
+// Containers own their elements.
 //
 // Reading never fails: a missing member, an element out of range or a value
 // of another kind yields null, 0, the empty string or one of the shared empty
@@ -86,7 +88,7 @@ class PObject {
   PObject() noexcept : type_(0), data_(nullptr) {}
   PObject(const char* s);
   PObject(const std::string& s);
-  PObject(uint64_t n);
+  PObject(uint64_t n) noexcept;
   PObject(const buffer_type& b);
   PObject(const PObject& other);
   // Takes other's payload; other is left null. Cheap, so containers of
@@ -125,8 +127,8 @@ class PObject {
   // Releases the payload; the value becomes null.
   void clear() noexcept;
 
-  // Kind tests. isNull looks at the payload pointer, the others at the tag.
-  bool isNull() const { return data_ == nullptr; }
+  // Kind tests. A value is null exactly when it holds no payload.
+  bool isNull() const { return type_ == 0; }
   bool isArray() const { return type_ == 1; }
   bool isMap() const { return type_ == 2; }
   bool isInteger() const { return type_ == 3; }
@@ -197,10 +199,14 @@ class PObject {
   // this value.
   template <typename T>
   PObject& reset(T&& value);
+  PObject& setInteger(uint64_t n) noexcept;
   const PObject* nthMapEntry(int n) const;
 
   uint32_t type_;
-  void* data_;
+  union {
+    void* data_;        // the heap payload of every kind but the integer
+    uint64_t number_;   // the integer itself
+  };
 };
 
 // The tags are the wire format's; they must never change.

@@ -60,6 +60,8 @@ class PStream {
   static constexpr uint64_t kMaxDepth = 64;
   // Block size of binary transfers, the channel capacity of the endpoints.
   static constexpr uint64_t kBlockSize = 81920;
+  // Texts up to this length are received through a buffer on the stack.
+  static constexpr unsigned short kShortString = 256;
   // The default size bound of a received message, and what each received
   // value counts towards it besides its string bytes (about what a value
   // costs in memory, so that a message of many tiny values cannot grow the

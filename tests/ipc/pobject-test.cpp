@@ -30,6 +30,16 @@ TEST(PObjectIntegers, AssignmentsExtendBySignednessAndReadersTruncate) {
   v = -2L;
   EXPECT_EQ(v.asInt64(), -2);
   EXPECT_EQ(PObject("12").asUInt64(), 0u);  // no parsing of strings
+  // The integer lives in the payload word: 0 is a value, not null, and it
+  // moves, copies and swaps like any other.
+  v = 0;
+  EXPECT_TRUE(v.isInteger() && !v.isNull() && !v.isEmpty());
+  PObject moved(std::move(v)), copied(moved), other("x");
+  EXPECT_TRUE(v.isNull() && moved.isInteger() && copied.isInteger() && copied.asUInt64() == 0);
+  other.swap(moved);
+  EXPECT_TRUE(other.isInteger() && moved.asString() == "x");
+  other = "text";  // replacing an integer releases nothing it does not own
+  EXPECT_EQ(other.toString(), "\"text\"");
 }
 
 TEST(PObjectReaders, AsStringAsBoolAndIsEmptyFollowTheKind) {

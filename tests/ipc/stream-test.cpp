@@ -132,6 +132,22 @@ TEST_F(WireTest, ReceivedBytesAndRefusals) {
   }
 }
 
+// Texts of every length end at their first zero byte, whichever way the
+// receiver reads them (short ones through the stack, long ones in place).
+TEST_F(WireTest, ReceivedTextsOfAnyLengthEndAtTheirFirstZeroByte) {
+  for (size_t length : {255u, 256u, 257u, 300u, 65535u}) {
+    for (size_t zero : {size_t{0}, length / 2, length - 1, length}) {
+      SCOPED_TRACE(testing::Message() << length << " bytes, zero at " << zero);
+      std::string text(length, 'x');
+      if (zero < length) text[zero] = '\0';
+      Reconnect();
+      PObject v;
+      ASSERT_EQ(Received(B({0x10, static_cast<int>(length >> 8), static_cast<int>(length & 0xff)}) + text, v), 0);
+      EXPECT_EQ(v.asStringRef(), std::string(std::min(zero, length), 'x'));
+    }
+  }
+}
+
 TEST_F(WireTest, PeerClosingMidMessageIsAnIOErrorWithTheKeyPath) {
   plovo_test::LogCapture log;
   PObject v;

@@ -1,6 +1,7 @@
 // The task methods through Process against the test daemon: the request the
 // daemon receives and the answer the web interface gets.
 #include <dlfcn.h>
+#include <sys/syscall.h>
 #include <json/reader.h>
 #include <syslog.h>
 #include <sys/wait.h>
@@ -9,6 +10,7 @@
 #include <velt/sched.h>
 
 #include <atomic>
+#include <cstdarg>
 #include <map>
 #include <cerrno>
 #include <memory>
@@ -391,8 +393,8 @@ TEST_F(TaskActionTest, NextRunTimeComesFromAnEnabledSchedule) {
 }
 
 // The server may have given up root for good: create then leaves the
-// request unanswered so that the server's own answer stands. setresuid is
-// taken over in this program to refuse the raise of the action (the third
+// request unanswered so that the server's own answer stands. The id change
+// is taken over in this program to refuse the raise of the action (the third
 // call in the request: the gate raises and restores first).
 std::atomic<int> gSetresuidLeft{-1};
 
@@ -453,15 +455,21 @@ TEST_F(TaskActionTest, ConcurrentRequestsAreEachAnsweredRight) {
 
 }  // namespace
 
-// Passes every call through to the C library until gSetresuidLeft calls
-// have been made, then refuses them.
-extern "C" int setresuid(uid_t ruid, uid_t euid, uid_t suid) {
-  using Fn = int (*)(uid_t, uid_t, uid_t);
-  static const Fn real = reinterpret_cast<Fn>(dlsym(RTLD_NEXT, "setresuid"));
-  if (gSetresuidLeft.load() == 0) {
+// The guard changes the thread's ids with the raw system call. This passes
+// every call through to the C library until gSetresuidLeft changes of the
+// user id have been made, then refuses them. No other code of the program
+// calls syscall() with more than the three arguments of these two calls.
+extern "C" long syscall(long number, ...) {
+  using Fn = long (*)(long, ...);
+  static const Fn real = reinterpret_cast<Fn>(dlsym(RTLD_NEXT, "syscall"));
+  va_list args;
+  va_start(args, number);
+  long a = va_arg(args, long), b = va_arg(args, long), c = va_arg(args, long);
+  va_end(args);
+  if (number == SYS_setresuid && gSetresuidLeft.load() == 0) {
     errno = EPERM;
     return -1;
   }
-  if (gSetresuidLeft.load() > 0) --gSetresuidLeft;
-  return real(ruid, euid, suid);
+  if (number == SYS_setresuid && gSetresuidLeft.load() > 0) --gSetresuidLeft;
+  return real(number, a, b, c);
 }
