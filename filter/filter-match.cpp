@@ -60,26 +60,27 @@ bool HasSuffix(const vt_string_set& set, const Name& name) {
   return false;
 }
 
-// Pattern p of length pl against s of length sl, "*" standing for any run.
-// Backtracks only to the last "*", so the cost stays at most pl * sl.
+// Pattern p of length pl, which begins and ends with "*", against s of
+// length sl. Each run of literal characters between stars is looked for
+// leftmost after the run before it: a later place could only leave less
+// room to the runs that follow, so the leftmost never loses a match. With
+// memmem's linear search the cost stays about pl + sl, where backtracking
+// to the last "*" could cost pl * sl.
 bool GlobMatch(const char* p, size_t pl, const char* s, size_t sl) {
-  size_t pi = 0, si = 0, star = SIZE_MAX, mark = 0;
-  while (si < sl) {
-    if (pi < pl && p[pi] == '*') {
-      star = pi++;
-      mark = si;
-    } else if (pi < pl && p[pi] == s[si]) {
+  size_t si = 0;
+  for (size_t pi = 0; pi < pl;) {
+    if (p[pi] == '*') {
       ++pi;
-      ++si;
-    } else if (star != SIZE_MAX) {
-      pi = star + 1;
-      si = ++mark;
-    } else {
-      return false;
+      continue;
     }
+    const char* star = static_cast<const char*>(memchr(p + pi, '*', pl - pi));
+    const size_t run = static_cast<size_t>(star - (p + pi));
+    const char* found = static_cast<const char*>(memmem(s + si, sl - si, p + pi, run));
+    if (found == nullptr) return false;
+    si = static_cast<size_t>(found - s) + run;
+    pi += run;
   }
-  while (pi < pl && p[pi] == '*') ++pi;
-  return pi == pl;
+  return true;
 }
 
 bool MatchesGlob(const vt_string_set& set, const Name& name) {

@@ -1,5 +1,9 @@
 #include "filter/filter-parser.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <cinttypes>
 #include <cstring>
 
@@ -71,9 +75,9 @@ void SkipBlanks(Reader& r) {
 // Whether nothing but a comment is left (blanks already skipped).
 bool AtLineEnd(const Reader& r) { return r.p == r.end || *r.p == '#'; }
 
-// Reads one line into buffer as fgets would, without the line feed; false at
-// the end of the text.
-bool ReadLine(FILE* stream, char* buffer, size_t* length, bool* newline) {
+// Reads one line into buffer as fgets would, without the line feed. Returns
+// the bytes taken from the stream, the line feed included; 0 at the end.
+size_t ReadLine(FILE* stream, char* buffer, size_t* length, bool* newline) {
   size_t n = 0;
   int c = 0;
   while (n < kFilterLineBuffer - 1 && (c = getc(stream)) != EOF) {
@@ -82,7 +86,12 @@ bool ReadLine(FILE* stream, char* buffer, size_t* length, bool* newline) {
   }
   *newline = n > 0 && buffer[n - 1] == '\n';
   *length = *newline ? n - 1 : n;
-  return n > 0;
+  return n;
+}
+
+int Fail(int error, int lineNumber) {
+  fprintf(stderr, "parser: %s at line %d\n", parse_error_name(error), lineNumber);
+  return 2;
 }
 
 int ParseSection(Reader& r) {
@@ -297,8 +306,23 @@ const char* parse_error_name(int code) {
 }
 
 int parse(const char* path, const filter_schema* schema, void* record) {
-  FILE* stream = fopen(path, "re");
-  if (stream == nullptr) return 2;
+  // Non-blocking, so that a FIFO without a writer cannot hold the open; the
+  // reads that follow block as usual.
+  const int fd = open(path, O_RDONLY | O_NONBLOCK | O_CLOEXEC);
+  if (fd < 0) return 2;
+  struct stat st;
+  const int flags = fcntl(fd, F_GETFL);
+  // Only a regular file is sure to end: a FIFO, a device or a terminal may
+  // feed the reader for ever.
+  if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode) || flags < 0 || fcntl(fd, F_SETFL, flags & ~O_NONBLOCK) != 0) {
+    close(fd);
+    return Fail(-PARSE_INTERNAL_ERROR, 0);
+  }
+  FILE* stream = fdopen(fd, "r");
+  if (stream == nullptr) {
+    close(fd);
+    return 2;
+  }
   const int result = parse_stream(stream, schema, record);
   fclose(stream);
   return result;
@@ -311,14 +335,15 @@ int parse_stream(FILE* stream, const filter_schema* schema, void* record) {
   char line[kFilterLineBuffer];
   size_t length = 0;
   int lineNumber = 0;
-  while (ReadLine(stream, line, &length, &r.newline)) {
+  size_t total = 0;
+  while (const size_t taken = ReadLine(stream, line, &length, &r.newline)) {
     ++lineNumber;
+    // Bounds the memory a record takes and the time a test against it costs.
+    total += taken;
+    if (total > kFilterFileMax) return Fail(-PARSE_INTERNAL_ERROR, lineNumber);
     r.p = line;
     r.end = line + length;
-    if (const int error = ParseLine(r); error != 0) {
-      fprintf(stderr, "parser: %s at line %d\n", parse_error_name(error), lineNumber);
-      return 2;
-    }
+    if (const int error = ParseLine(r); error != 0) return Fail(error, lineNumber);
   }
   if (ferror(stream)) return 2;
   return r.unknownKeys > 0 ? 1 : 0;

@@ -1,10 +1,12 @@
 #include "filter/filter.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstddef>
 #include <cstdlib>
+#include <cstring>
 #include <string>
 
 #define KEY(name, kind, sub, field) {name, kind, offsetof(sub, field)}
@@ -62,8 +64,20 @@ const filter_schema white_list_schema = {
 
 namespace {
 
+// Syncs the folder that holds path, so that a rename in it survives a
+// power cut.
+bool SyncFolder(const char* path) {
+  const char* slash = strrchr(path, '/');
+  const std::string folder = slash == nullptr ? "." : slash == path ? "/" : std::string(path, slash);
+  const int fd = open(folder.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  if (fd < 0) return false;
+  const bool ok = fsync(fd) == 0;
+  close(fd);
+  return ok;
+}
+
 // Prints through print into a temporary file beside path and renames it
-// over path.
+// over path. On any failure before the rename the temporary is removed.
 template <typename Record>
 int WriteRecord(const char* path, const Record* record, int (*print)(FILE*, const Record*)) {
   std::string temporary = std::string(path) + ".XXXXXX";
@@ -78,8 +92,11 @@ int WriteRecord(const char* path, const Record* record, int (*print)(FILE*, cons
   bool ok = fchmod(fd, 0644) == 0 && print(stream, record) == 0 && fflush(stream) == 0 && fsync(fd) == 0;
   ok = fclose(stream) == 0 && ok;
   ok = ok && rename(temporary.c_str(), path) == 0;
-  if (!ok) unlink(temporary.c_str());
-  return ok ? 0 : -1;
+  if (!ok) {
+    unlink(temporary.c_str());
+    return -1;
+  }
+  return SyncFolder(path) ? 0 : -1;
 }
 
 }  // namespace

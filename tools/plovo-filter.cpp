@@ -10,7 +10,10 @@
 //     the black-list path test or the white-list test for PATH (a folder
 //     with --dir) as one decimal line, and exits 0.
 //
-// Wrong usage prints the usage line on stderr and exits 64.
+// Wrong usage prints the usage line on stderr and exits 64. When standard
+// output cannot be written (a full disk, a closed pipe), a message goes to
+// stderr and the exit status is 74, whatever the parse result.
+#include <cerrno>
 #include <cstdio>
 #include <cstring>
 
@@ -20,6 +23,14 @@
 namespace {
 
 constexpr int kUsageStatus = 64;
+constexpr int kOutputErrorStatus = 74;
+
+// status, or kOutputErrorStatus when what went to stdout did not all get out.
+int Flushed(bool printed, int status) {
+  if (printed && fflush(stdout) == 0 && !ferror(stdout)) return status;
+  fprintf(stderr, "plovo-filter: cannot write to standard output: %s\n", strerror(errno));
+  return kOutputErrorStatus;
+}
 
 int Usage() {
   fputs("usage: plovo-filter print black|white FILE | plovo-filter test black|white FILE PATH [--dir]\n", stderr);
@@ -28,20 +39,21 @@ int Usage() {
 
 int Print(bool black, const char* file) {
   int result = 0;
+  bool printed = true;
   if (black) {
     black_list_filter filter;
     filter_init(&filter);
     result = filter_read(file, &filter);
-    if (result != 2) filter_print(stdout, &filter);
+    if (result != 2) printed = filter_print(stdout, &filter) == 0;
     filter_destroy(&filter);
   } else {
     white_list list;
     white_list_init(&list);
     result = white_list_read(file, &list);
-    if (result != 2) white_list_print(stdout, &list);
+    if (result != 2) printed = white_list_print(stdout, &list) == 0;
     white_list_destroy(&list);
   }
-  return result;
+  return Flushed(printed, result);
 }
 
 int Test(bool black, const char* file, const char* path, bool isDirectory) {
@@ -52,17 +64,16 @@ int Test(bool black, const char* file, const char* path, bool isDirectory) {
     const bool read = filter_read(file, &filter) != 2;
     if (read) result = filter_test_path(&filter, path, isDirectory);
     filter_destroy(&filter);
-    if (!read) return 2;
+    if (!read) return Flushed(true, 2);
   } else {
     white_list list;
     white_list_init(&list);
     const bool read = white_list_read(file, &list) != 2;
     if (read) result = white_list_test(&list, path, isDirectory);
     white_list_destroy(&list);
-    if (!read) return 2;
+    if (!read) return Flushed(true, 2);
   }
-  printf("%d\n", result);
-  return 0;
+  return Flushed(printf("%d\n", result) > 0, 0);
 }
 
 }  // namespace

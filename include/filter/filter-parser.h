@@ -6,10 +6,13 @@
 // after a "," goes on in the next line, which begins with a double quote.
 // Values are numbers (digits, optionally "." and digits; a fractional part
 // is read and dropped), quoted strings with C escapes, or sets of quoted
-// strings separated by ",". A line is read into a buffer of 6145 bytes: a
-// line longer than 6144 characters is read as several lines. Section and
-// key names hold at most 32 letters, digits, "-" or "_"; numbers and
-// strings at most 1023 characters (strings counted after unescaping).
+// strings separated by ",". A line is read as fgets reads it into a buffer
+// of 6145 bytes: pieces of at most 6144 bytes, the line feed counted, each a
+// line of its own for the messages (so a line of 6144 characters is followed
+// by an empty line holding its line feed). A file holds at most
+// kFilterFileMax bytes. Section and key names hold at most 32 letters,
+// digits, "-" or "_"; numbers and strings at most 1023 characters (strings
+// counted after unescaping; a number's dot counted).
 //
 // The reader knows the records only through a schema: a static table of
 // sections, each with the offset of its sub-record in the target record,
@@ -86,12 +89,15 @@ enum {
   PARSE_VALUE_TOO_LONG = 23,
   PARSE_LINE_NOT_ENDED = 24,
   PARSE_LINE_NOT_EXPECTED = 25,
-  PARSE_INTERNAL_ERROR = 26,
+  PARSE_INTERNAL_ERROR = 26,  // also: not a regular file (line 0), a file over kFilterFileMax bytes
 };
 
-constexpr size_t kFilterLineBuffer = 6145;  // so at most 6144 characters a line
+constexpr size_t kFilterLineBuffer = 6145;  // so pieces of at most 6144 bytes, the line feed counted
 constexpr size_t kFilterNameMax = 32;
 constexpr size_t kFilterValueMax = 1023;
+// A list file is a few kilobytes; the bound keeps what a hostile one can
+// cost (memory, and time per path tested) small.
+constexpr size_t kFilterFileMax = 1 << 20;
 
 // The name of an error code as the error message prints it: the table's name
 // for 0 to -26, "Unknown error" for anything else.
@@ -100,10 +106,14 @@ const char* parse_error_name(int code);
 // Reads the file at path into record, whose layout schema describes and
 // which the caller has initialised. Returns 0 on success, 1 on success with
 // at least one unknown key (each warned of on standard output), 2 when the
-// file cannot be opened or on a parse error (printed on standard error with
-// its line). After 2 the record may be partly filled; the caller destroys it.
+// file cannot be opened (no message) or on a parse error (printed on
+// standard error with its line). A path that is not a regular file (a FIFO,
+// a device, a folder) is refused unread: INTERNAL_ERROR at line 0. A file
+// longer than kFilterFileMax bytes fails with INTERNAL_ERROR at the line
+// that passes the bound. After 2 the record may be partly filled; the
+// caller destroys it.
 int parse(const char* path, const filter_schema* schema, void* record);
-// The same from an open stream, which stays open.
+// The same from an open stream, which stays open; the size bound holds.
 int parse_stream(FILE* stream, const filter_schema* schema, void* record);
 
 // Exact, case-sensitive search by name; nullptr when there is none.

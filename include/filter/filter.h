@@ -80,9 +80,11 @@ void filter_init(black_list_filter* filter);
 int filter_read(const char* path, black_list_filter* filter);
 // 0, or -1 on a write error.
 int filter_print(FILE* stream, const black_list_filter* filter);
-// Prints into a new file beside path, then renames it over path, so that a
-// reader sees the old file or the whole new one. 0, or -1 with nothing left
-// behind.
+// Prints into a new file (mode 0644) beside path, syncs it, renames it over
+// path and syncs the folder, so that a reader, also after a power cut, sees
+// the old file or the whole new one. 0; or -1 with the old file in place and
+// no temporary left, except when only the folder's sync failed: the new
+// file is then in place but may not survive a power cut.
 int filter_write(const char* path, const black_list_filter* filter);
 // Makes dst (initialised) a deep copy of src: 0, or -1 with dst unchanged.
 int filter_copy(black_list_filter* dst, const black_list_filter* src);

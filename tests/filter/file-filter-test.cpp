@@ -1,10 +1,14 @@
 // FileFilter's loading and combined test, the list files the web interface
 // edits, and the plovo-filter tool run as its own process.
+#include <dirent.h>
 #include <fcntl.h>
+#include <signal.h>
 #include <syslog.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstring>
 #include <string>
 #include <vector>
 
@@ -54,6 +58,48 @@ TEST_F(FileFilterTest, ListsThatCannotBeWrittenOrReadFail) {
   EXPECT_EQ(-1, ReadBlackList(Path("/black.filter"), names, extensions));
   EXPECT_EQ(-1, ReadWhiteList(Path("/missing.filter"), names, extensions));
   EXPECT_EQ(Strings({"kept"}), names);
+}
+
+TEST_F(FileFilterTest, AFailedRenameLeavesNoTemporaryAndTheTargetAsItWas) {
+  // A folder in the target's place: the temporary is written, the rename fails.
+  WriteFile("/target/kept", "old");
+  EXPECT_EQ(-1, WriteBlackList(Path("/target"), {"a"}, {}));
+  EXPECT_EQ(-1, WriteWhiteList(Path("/target"), {"a"}, {}));
+  std::vector<std::string> entries;
+  DIR* root = opendir(Root().c_str());
+  ASSERT_NE(nullptr, root);
+  while (const dirent* entry = readdir(root)) {
+    if (strcmp(entry->d_name, ".") != 0 && strcmp(entry->d_name, "..") != 0) entries.emplace_back(entry->d_name);
+  }
+  closedir(root);
+  EXPECT_EQ(Strings({"target"}), entries);
+  EXPECT_EQ("old", ReadFile("/target/kept"));
+}
+
+TEST_F(FileFilterTest, ListsAreWrittenWithMode0644WhateverTheUmask) {
+  const mode_t old = umask(077);
+  const int black = WriteBlackList(Path("/black.filter"), {"a"}, {});
+  const int white = WriteWhiteList(Path("/white.filter"), {"a"}, {});
+  umask(old);
+  ASSERT_EQ(0, black);
+  ASSERT_EQ(0, white);
+  for (const char* file : {"/black.filter", "/white.filter"}) {
+    struct stat st;
+    ASSERT_EQ(0, stat(Path(file).c_str(), &st));
+    EXPECT_EQ(0644u, st.st_mode & 07777) << file;
+  }
+}
+
+TEST_F(FileFilterTest, ListsWithUnknownKeysReadTheirMembers) {
+  WriteFile("/black.filter", "[Common]\nfuture = 1\nblack_name = \"a\"\n[File]\nblack_ext = \"jpg\"\n");
+  WriteFile("/white.filter", "[Common]\nwhite_name = \"b\"\n[File]\nlater = \"x\"\nwhite_ext = \"png\"\n");
+  Strings names, extensions;
+  ::testing::internal::CaptureStdout();
+  EXPECT_EQ(0, ReadBlackList(Path("/black.filter"), names, extensions));
+  EXPECT_EQ(0, ReadWhiteList(Path("/white.filter"), names, extensions));
+  EXPECT_EQ("warning: unknown key (future)\nwarning: unknown key (later)\n", ::testing::internal::GetCapturedStdout());
+  EXPECT_EQ(Strings({"a", "b"}), names);
+  EXPECT_EQ(Strings({"jpg", "png"}), extensions);
 }
 
 TEST_F(FileFilterTest, ListsNotLoadedLetEverythingPass) {
@@ -115,10 +161,13 @@ class PlovoFilterTool : public plovo_test::SandboxTest {
     int status;
     std::string out, err;
   };
-  Outcome Run(const std::vector<std::string>& args) {
-    pid_t pid = fork();
+  // Runs the tool with stdout into out (a sandbox file unless given) and
+  // stderr into a sandbox file; a run of more than 10 s is killed and fails.
+  Outcome Run(const std::vector<std::string>& args, std::string out = "") {
+    if (out.empty()) out = Path("/out");
+    const pid_t pid = fork();
     if (pid == 0) {
-      dup2(open(Path("/out").c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
+      dup2(open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
       dup2(open(Path("/err").c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 2);
       std::vector<char*> argv = {const_cast<char*>(PLOVO_FILTER_PATH)};
       for (const std::string& a : args) argv.push_back(const_cast<char*>(a.c_str()));
@@ -127,8 +176,15 @@ class PlovoFilterTool : public plovo_test::SandboxTest {
       _exit(127);
     }
     int status = 0;
-    waitpid(pid, &status, 0);
-    return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, ReadFile("/out"), ReadFile("/err")};
+    pid_t done = 0;
+    for (int waited = 0; (done = waitpid(pid, &status, WNOHANG)) == 0 && waited < 1000; ++waited) usleep(10000);
+    if (done != pid) {
+      kill(pid, SIGKILL);
+      waitpid(pid, &status, 0);
+      ADD_FAILURE() << "plovo-filter ran for more than 10 s";
+      return {-1, "", ""};
+    }
+    return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, Exists("/out") ? ReadFile("/out") : "", ReadFile("/err")};
   }
 };
 
@@ -165,6 +221,20 @@ TEST_F(PlovoFilterTool, PrintsTestsAndExitsWithTheParseResult) {
     EXPECT_EQ(c.status, outcome.status);
     EXPECT_EQ(c.out, outcome.out);
     EXPECT_EQ(c.err, outcome.err);
+  }
+}
+
+TEST_F(PlovoFilterTool, AnOutputThatCannotBeWrittenExits74) {
+  WriteFile("/black.filter", "[Common]\nblack_name = \"Secret\"\nfuture = 1\n");
+  const std::vector<std::string> cases[] = {
+      {"print", "black", Path("/black.filter")},
+      {"test", "black", Path("/black.filter"), "/a/secret"},
+  };
+  for (const auto& args : cases) {
+    SCOPED_TRACE(args[0]);
+    const Outcome outcome = Run(args, "/dev/full");
+    EXPECT_EQ(74, outcome.status);
+    EXPECT_EQ("plovo-filter: cannot write to standard output: No space left on device\n", outcome.err);
   }
 }
 

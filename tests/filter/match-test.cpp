@@ -15,7 +15,7 @@ using plovo_test::WhiteList;
 // One member for every rule, each distinct enough to be hit alone.
 const char kBlackList[] =
     "[Common]\n"
-    "black_char = \"!\"\n"
+    "black_char = \"!Q\"\n"
     "black_name = \"Common-Name\"\n"
     "black_prefix = \"cpre\"\n"
     "black_suffix = \"csuf\"\n"
@@ -53,13 +53,21 @@ TEST(FilterMatch, EachRuleGivesItsCodeInOrder) {
       {"/Blocked/Dir", true, -264},
       {"/blocked/DIR/x.txt", false, -264},
       {"/Blocked/Dirx/y.txt", false, 0},
+      {"/a/" + name31.substr(1), false, 0},  // max_length 30: a name of 30 passes
       {"/a/" + name31, false, -265},
       {"/a/!" + name31, false, -265},  // max_length before black_char
       {"/a/b!c.txt", false, -258},
+      {"/a/aqua", false, -258},  // "Q" folded like the name
       {"/a/b!%c.txt", false, -258},  // Common before File
       {"/a/COMMON-NAME", false, -261},
       {"/a/CPREfix.txt", false, -259},
+      {"/a/cpre", false, -259},  // a prefix or suffix may be the whole name
       {"/a/name.CSUF", false, -260},
+      {"/a/csuf", false, -260},
+      {"/a/fpre", false, -515},
+      {"/a/fsuf", false, -516},
+      {"/dpre", true, -771},
+      {"/dsuf", true, -772},
       {"/a/b%c.txt", false, -514},
       {"/a/fpre.txt", false, -515},
       {"/a/fpre.jpg", false, -515},  // prefix before extension
@@ -68,6 +76,8 @@ TEST(FilterMatch, EachRuleGivesItsCodeInOrder) {
       {"/a/XaYbZ", false, -519},
       {"/a/xyz", false, -519},
       {"/a/xzy", false, 0},
+      {"/a/xz", false, 0},  // the middle "y" must be there
+      {"/a/xayz", false, -519},
       {"/a/a?c", false, -519},
       {"/a/abc", false, 0},  // "?" is no wildcard
       {"/a/file-name", false, -517},
@@ -93,6 +103,46 @@ TEST(FilterMatch, EachRuleGivesItsCodeInOrder) {
   for (const auto& c : cases) {
     SCOPED_TRACE(c.path + (c.isDirectory ? " (folder)" : ""));
     EXPECT_EQ(c.code, filter_test_path(&list.record, c.path.c_str(), c.isDirectory));
+  }
+}
+
+// Each path breaks exactly two rules that follow each other in the order:
+// the earlier one's code must come out. Together the rows cover every
+// neighbouring pair, so swapping any two neighbours fails a row.
+TEST(FilterMatch, OfTwoRulesBrokenTheEarlierDecides) {
+  const struct {
+    const char* list;
+    const char* path;
+    bool isDirectory;
+    int code;
+  } cases[] = {
+      {"[Common]\nblack_dir_prefix = \"/d\"\nmax_length = 1\n", "/d/ab", false, -264},
+      {"[Common]\nmax_length = 1\nblack_char = \"a\"\n", "/d/ab", false, -265},
+      {"[Common]\nblack_char = \"a\"\nblack_name = \"ab\"\n", "/d/ab", false, -258},
+      {"[Common]\nblack_name = \"ab\"\nblack_prefix = \"a\"\n", "/d/ab", false, -261},
+      {"[Common]\nblack_prefix = \"a\"\nblack_suffix = \"b\"\n", "/d/ab", false, -259},
+      {"[Common]\nblack_suffix = \"b\"\n[File]\nblack_char = \"a\"\n", "/d/ab", false, -260},
+      {"[File]\nblack_char = \"a\"\nblack_prefix = \"a\"\n", "/d/ab", false, -514},
+      {"[File]\nblack_prefix = \"a\"\nblack_suffix = \"b\"\n", "/d/ab", false, -515},
+      {"[File]\nblack_suffix = \"b\"\nblack_glob = \"a*\"\n", "/d/ab", false, -516},
+      {"[File]\nblack_glob = \"a*\"\nblack_name = \"ab\"\n", "/d/ab", false, -519},
+      {"[File]\nblack_name = \"a.b\"\nblack_ext = \"b\"\n", "/d/a.b", false, -517},
+      // The file's own name before its folders.
+      {"[Common]\nmax_length = 3\n[File]\nblack_ext = \"b\"\n", "/long/a.b", false, -518},
+      {"[File]\nblack_name = \"ab\"\n[Directory]\nblack_name = \"d\"\n", "/d/ab", false, -517},
+      {"[Common]\nblack_suffix = \"b\"\n[Directory]\nblack_char = \"a\"\n", "/ab", true, -260},
+      {"[Directory]\nblack_char = \"a\"\nblack_name = \"ab\"\n", "/ab", true, -770},
+      {"[Directory]\nblack_name = \"ab\"\nblack_prefix = \"a\"\n", "/ab", true, -773},
+      {"[Directory]\nblack_prefix = \"a\"\nblack_glob = \"a*\"\n", "/ab", true, -771},
+      {"[Directory]\nblack_glob = \"a*\"\nblack_suffix = \"b\"\n", "/ab", true, -775},
+      // An earlier folder before a later one.
+      {"[Common]\nmax_length = 2\n[Directory]\nblack_suffix = \"b\"\n", "/ab/abc", true, -772},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(std::string(c.list) + c.path);
+    BlackList list(c.list);
+    ASSERT_EQ(0, list.output.result) << list.output.err;
+    EXPECT_EQ(c.code, filter_test_path(&list.record, c.path, c.isDirectory));
   }
 }
 

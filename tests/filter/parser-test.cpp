@@ -1,11 +1,18 @@
 // The filter file reader and printer: every error at its line with its
 // message, what reads into which field, and that what is printed reads back.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <string>
 
+#include "bounded.h"
 #include "filter-text.h"
 #include "filter/filter.h"
+#include "sandbox.h"
 
 namespace {
 
@@ -58,6 +65,7 @@ TEST(FilterParse, EachErrorIsReportedWithItsNameAndLine) {
       {"[Common]\nblack_name = \"", std::string(1024, 'a') + "\"\n", "VALUE_TOO_LONG at line 2"},
       {"[Common]\nblack_name = \"", std::string(1024, '$') + "\"\n", "VALUE_TOO_LONG at line 2"},
       {"[Common]\nmax_path = ", std::string(1024, '1') + "\n", "VALUE_TOO_LONG at line 2"},
+      {"[Common]\nmax_path = ", std::string(1022, '0') + ".0\n", "VALUE_TOO_LONG at line 2"},  // the dot counts
       {"[Common]  x\n", "", "LINE_NOT_ENDED at line 1"},
       {"[Common]\nmax_path = 5 6\n", "", "LINE_NOT_ENDED at line 2"},
       {"[Common]\nblack_char = \"a\", \"b\"\n", "", "LINE_NOT_ENDED at line 2"},
@@ -110,6 +118,9 @@ TEST(FilterParse, AcceptedTextsPrintAsExpected) {
        "[Version]\nmajor = 0\nminor = 0\n[Common]\nblack_dir_prefix = \"/p\", \"/q\"\nmax_length = 0\n"
        "max_path = 0\nmax_dst_path = 0\n[File]\nblack_ext = \"jpg\"\nblack_name = \"n\"\nmax_size = 9\n"
        "[Directory]\n"},
+      {"a number of 1023 characters", "[Common]\nmax_path = " + std::string(1023, '0') + "\n", 0, kEmptyBlack},
+      {"a number of 1023 characters, the dot included",
+       "[Common]\nmax_path = " + std::string(1021, '0') + ".0\n", 0, kEmptyBlack},
       {"unknown keys are read by their look and dropped",
        "[Common]\nfuture = \"x\",\n  \"y\"\nlater = 12.5\nmax_path = 1\n", 1,
        "[Version]\nmajor = 0\nminor = 0\n[Common]\nmax_length = 0\nmax_path = 1\nmax_dst_path = 0\n"
@@ -196,6 +207,27 @@ TEST(FilterPrint, AStringIsCutAtWholeEscapesWithin1023Characters) {
   EXPECT_EQ(std::string(255, '$'), Member(again.record.file.black_name, 0));
 }
 
+TEST(FilterPrint, APlainStringIsCutAt1023Characters) {
+  const struct {
+    std::string raw;
+    std::string printed;  // between the quotes
+  } cases[] = {
+      {std::string(1022, 'a'), std::string(1022, 'a')},
+      {std::string(1023, 'a'), std::string(1023, 'a')},
+      {std::string(1024, 'a'), std::string(1023, 'a')},
+      {std::string(1022, 'a') + "$", std::string(1022, 'a')},  // the escape does not fit whole
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.raw.size());
+    black_list_filter filter;
+    filter_init(&filter);
+    ASSERT_EQ(0, vt_string_assign(&filter.directory.black_char, c.raw.data(), c.raw.size()));
+    const std::string printed = plovo_test::PrintText(black_list_filter_schema, &filter);
+    filter_destroy(&filter);
+    EXPECT_NE(std::string::npos, printed.find("[Directory]\nblack_char = \"" + c.printed + "\"\n")) << printed.size();
+  }
+}
+
 TEST(FilterPrint, CopyIsDeepAndEqual) {
   BlackList list("[Version]\nminor = 2\n[Common]\nblack_char = \"x\"\n[File]\nblack_glob = \"*.a\", \"b*\"\n"
                  "[Directory]\nblack_suffix = \"~\"\n");
@@ -216,12 +248,79 @@ TEST(FilterParse, MissingFileGivesTwo) {
   filter_destroy(&filter);
 }
 
-TEST(FilterParse, LongLinesAreReadAsSeveralLines) {
-  // A comment of 7000 characters: its last 856 are read as a line of their
-  // own, which is no key.
-  BlackList list("[Common]\n#" + std::string(6999, '%') + "\n");
-  EXPECT_EQ(2, list.output.result);
-  EXPECT_EQ("parser: KEY_MISSING_KEY at line 3\n", list.output.err);
+TEST(FilterParse, LinesAreReadInPiecesOf6144BytesWithTheLineFeed) {
+  // Each piece counts as a line: the line "x" after the comment shows where
+  // the count stands.
+  const struct {
+    size_t commentLength;  // characters of the comment line, "#" included
+    const char* message;
+  } cases[] = {
+      {6143, "parser: KEY_ILLEGAL_CHARACTER at line 3\n"},  // the line and its line feed in one piece
+      {6144, "parser: KEY_ILLEGAL_CHARACTER at line 4\n"},  // the line feed alone in a second piece
+      {6145, "parser: KEY_MISSING_KEY at line 3\n"},        // the 6145th character begins a line
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.commentLength);
+    BlackList list("[Common]\n#" + std::string(c.commentLength - 2, '%') + "%\nx\n");
+    EXPECT_EQ(2, list.output.result);
+    EXPECT_EQ(c.message, list.output.err);
+  }
+}
+
+TEST(FilterParse, AFileOverOneMebibyteFailsAtTheLineThatPassesTheBound) {
+  // Comment lines of 1024 bytes after the header, the last one shortened so
+  // that the text is exactly the bound.
+  std::string text = "[Common]\n";
+  int lines = 1;
+  while (text.size() < kFilterFileMax) {
+    const size_t room = kFilterFileMax - text.size();
+    text += "#" + std::string(std::min<size_t>(room, 1024) - 2, 'c') + "\n";
+    ++lines;
+  }
+  ASSERT_EQ(kFilterFileMax, text.size());
+  BlackList exact(text);
+  EXPECT_EQ(0, exact.output.result) << exact.output.err;
+  BlackList over(text + "\n");
+  EXPECT_EQ(2, over.output.result);
+  EXPECT_EQ("parser: INTERNAL_ERROR at line " + std::to_string(lines + 1) + "\n", over.output.err);
+}
+
+class FilterFile : public plovo_test::SandboxTest {
+ protected:
+  // filter_read of path, bounded in time; its stderr in *err.
+  int Read(const std::string& path, std::string* err) {
+    black_list_filter filter;
+    filter_init(&filter);
+    ::testing::internal::CaptureStderr();
+    const int result = plovo_test::Bounded([&] { return filter_read(path.c_str(), &filter); },
+                                           [&] { close(open(path.c_str(), O_WRONLY | O_NONBLOCK)); });
+    *err = ::testing::internal::GetCapturedStderr();
+    filter_destroy(&filter);
+    return result;
+  }
+};
+
+TEST_F(FilterFile, OnlyARegularFileIsRead) {
+  ASSERT_EQ(0, mkfifo(Path("/fifo").c_str(), 0600));
+  MakeDir("/folder");
+  WriteFile("/regular", "[Common]\nmax_path = 1\n");
+  const struct {
+    std::string path;
+    int result;
+    const char* err;
+  } cases[] = {
+      {Path("/fifo"), 2, "parser: INTERNAL_ERROR at line 0\n"},
+      {Path("/folder"), 2, "parser: INTERNAL_ERROR at line 0\n"},
+      {"/dev/null", 2, "parser: INTERNAL_ERROR at line 0\n"},
+      {Path("/missing"), 2, ""},
+      {Path("/regular"), 0, ""},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.path);
+    std::string err;
+    EXPECT_EQ(c.result, Read(c.path, &err));
+    EXPECT_EQ(c.err, err);
+  }
 }
 
 TEST(FilterSchema, SearchesAreExactAndCaseSensitive) {
