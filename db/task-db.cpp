@@ -189,7 +189,10 @@ int TaskDB::Initialize(const std::string& path) {
     return 0;
   }
   sqlite3* db = nullptr;
-  int rc = sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
+  // Opened as root: a symbolic link planted in the database's place must
+  // not make root create or rewrite a file elsewhere.
+  int rc = sqlite3_open_v2(path.c_str(), &db,
+                           SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOFOLLOW, nullptr);
   if (rc != SQLITE_OK) {
     PLOVO_LIB_ERR("Failed to create task db at '%s'. [%d] %s\n", path.c_str(), rc,
                   sqlite3_errmsg(db));

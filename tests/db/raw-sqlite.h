@@ -12,7 +12,9 @@ namespace plovo_test {
 
 class RawSqlite {
  public:
-  explicit RawSqlite(const std::string& path) { sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE, nullptr); }
+  explicit RawSqlite(const std::string& path) {
+    sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
+  }
   ~RawSqlite() { sqlite3_close_v2(db_); }
   RawSqlite(const RawSqlite&) = delete;
   RawSqlite& operator=(const RawSqlite&) = delete;
@@ -36,7 +38,9 @@ class RawSqlite {
   std::string Columns(const std::string& table) const {
     return Rows("SELECT name, type, \"notnull\", dflt_value, pk FROM pragma_table_info('" + table + "')");
   }
-  void Exec(const std::string& sql) const { EXPECT_EQ(sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, nullptr), 0); }
+  // SQLite's result code for the statements.
+  int Run(const std::string& sql) const { return sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, nullptr); }
+  void Exec(const std::string& sql) const { EXPECT_EQ(Run(sql), 0); }
 
  private:
   sqlite3* db_ = nullptr;

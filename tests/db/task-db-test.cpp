@@ -234,35 +234,58 @@ TEST(EscapingTest, LiteralsAndPatterns) {
 }
 
 // Eight threads on one instance, each with its own device and tasks; run
-// under ThreadSanitizer by scripts/test.
+// under ThreadSanitizer by scripts/test. Each thread checks every result
+// and what it reads back; removing its device with tasks still on it must
+// take the tasks too, so nothing is left at the end.
 TEST_F(TaskDBTest, EightThreadsShareOneInstance) {
   std::vector<int> failures(8, 0);
   std::vector<std::thread> threads;
   for (int t = 0; t < 8; ++t) {
     threads.emplace_back([this, t, &failures] {
       int& failed = failures[t];
-      TaskDB::USBInfo device;
+      TaskDB::USBInfo device, readDevice;
       device.uuid = "dev-" + std::to_string(t);
       unsigned long usbId = 0;
       failed += db_.AddUSBInfo(device, usbId) != 0;
+      std::vector<TaskDB::TaskInfo> tasks(20);
       for (int i = 0; i < 20; ++i) {
-        TaskDB::TaskInfo task, read;
+        TaskDB::TaskInfo& task = tasks[i];
+        TaskDB::TaskInfo read;
         task.usb_id = usbId;
         task.task_name = device.uuid + "-" + std::to_string(i);
         failed += db_.AddTaskInfo(task, task.id) != 0;
-        failed += db_.GetTaskInfo(task.id, read) != 1 || read.task_name != task.task_name;
-        failed += db_.UpdateTaskInfo(task.id, i, 0) != 0 || (i % 2 == 0 && db_.RemoveTaskInfo(task.id) != 0);
+        failed += db_.UpdateTaskInfo(task.id, i + 1, 0) != 0;
+        failed += db_.GetTaskInfo(task.id, read) != 1 || read.task_name != task.task_name || read.error != i + 1;
+      }
+      // Half the tasks go; the device stays while it has any.
+      std::string kept;
+      for (int i = 0; i < 20; ++i) {
+        TaskDB::TaskInfo read;
+        if (i % 2 == 0) {
+          failed += db_.RemoveTaskInfo(tasks[i].id) != 0 || db_.GetTaskInfo(tasks[i].id, read) != 0;
+          failed += db_.GetUSBInfo(usbId, readDevice) != 1;
+        } else {
+          kept += tasks[i].task_name + ",";
+        }
       }
       std::list<TaskDB::TaskInfo> mine;
-      failed += db_.ListTaskInfo(usbId, mine) != 0 || mine.size() != 10;
-      failed += db_.RemoveUSBInfo(usbId) != 0;
+      failed += db_.ListTaskInfo(usbId, mine) != 0;
+      std::string listed;
+      for (const TaskDB::TaskInfo& task : mine) listed += task.task_name + ",";
+      failed += listed != kept;
+      failed += db_.RemoveUSBInfo(usbId) != 0 || db_.GetUSBInfo(usbId, readDevice) != 0;
+      failed += db_.ListTaskInfo(usbId, mine) != 0 || !mine.empty();
     });
   }
   for (std::thread& thread : threads) thread.join();
   EXPECT_EQ(failures, std::vector<int>(8, 0));
   std::list<TaskDB::USBInfo> devices;
+  std::list<TaskDB::TaskInfo> tasks;
   ASSERT_EQ(db_.ListUSBInfo(devices), 0);
-  EXPECT_TRUE(devices.empty());
+  ASSERT_EQ(db_.ListTaskInfo(tasks), 0);
+  EXPECT_EQ(devices.size() + tasks.size(), 0u);
+  EXPECT_EQ(RawSqlite(path_).Rows("SELECT (SELECT COUNT(*) FROM usb_info_table), COUNT(*) FROM task_info_table"),
+            "0 0");
 }
 
 }  // namespace

@@ -1,8 +1,12 @@
 // "get_log_list" through Process: the page, the filter as the request
-// gives it, and the errors with their data.
+// gives it, the errors with their data, and running as root.
 #include <json/reader.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
 #include <syslog.h>
+#include <unistd.h>
 
+#include <functional>
 #include <sstream>
 
 #include "common/utility.h"
@@ -113,11 +117,17 @@ TEST_F(LogListTest, BadParametersAre402) {
 }
 
 TEST_F(LogListTest, RepositoryAndDatabaseFailures) {
+  AddRows(3);  // a LIKE pattern is only refused when a row of id 1 is matched
   const Json::Value params = J(R"({"limit": 50, "offset": 0, "log_filter": {"log_desc_id_list": [1]}})");
   Json::Value tooMany = params;
-  for (unsigned id = 0; id < 1100; ++id) tooMany["log_filter"]["log_desc_id_list"].append(id);
+  for (unsigned id = 2; id < 1000; ++id) tooMany["log_filter"]["log_desc_id_list"].append(id);
+  Json::Value longKeyWord = params;
+  longKeyWord["log_filter"]["key_word"] = std::string(50000, 'k');
   WriteFile("/var/packages/Plovo/etc/setting.conf", "beep=\"yes\"\n");
   MakeDir("/volume2");
+  // A link in the database's place, to a file outside the folder.
+  MakeDir("/volume3/@Plovo/db");
+  ASSERT_EQ(symlink(Path("/outside.sqlite").c_str(), Path("/volume3/@Plovo/db/log-db.sqlite").c_str()), 0);
   const struct {
     const char* volume;  // "" for none recorded
     const Json::Value& params;
@@ -128,8 +138,11 @@ TEST_F(LogListTest, RepositoryAndDatabaseFailures) {
       {"", params, 401, "null", "Failed to get repo vol path"},
       // The database folder is missing: it is not made here.
       {"/volume2", params, 412, R"("Failed to init log db")", "Failed to init log db"},
-      // More conditions than SQLite nests.
+      {"/volume3", params, 412, R"("Failed to init log db")", "Failed to init log db"},
+      // 999 description ids nest deeper than SQLite allows; a LIKE pattern
+      // longer than it takes.
       {"/volume1", tooMany, 412, R"("Failed to get log info list")", "Failed to get log info list"},
+      {"/volume1", longKeyWord, 412, R"("Failed to get log info list")", "Failed to get log info list"},
   };
   for (const auto& c : cases) {
     if (*c.volume) SetRepository(c.volume);
@@ -142,8 +155,53 @@ TEST_F(LogListTest, RepositoryAndDatabaseFailures) {
     EXPECT_EQ(log.Contains("[ERR] log-db("), c.code == 412) << log.Dump();
   }
   EXPECT_FALSE(Exists("/volume2/@Plovo"));
+  EXPECT_FALSE(Exists("/outside.sqlite"));
   // The database made on the way is whole and usable.
   EXPECT_TRUE(Call("get_log_list", params).IsSuccess());
+}
+
+// The action raises to root itself. Each case runs in a child process
+// that gives up root its own way; the child's exit status says what went
+// wrong.
+TEST_F(LogListTest, RunsAsRootAndDropsBack) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to set up the ids";
+  ASSERT_EQ(chmod(Path("/volume1/@Plovo/db").c_str(), 0700), 0);
+  const Json::Value params = J(R"({"limit": 50, "offset": 0, "log_filter": {"log_desc_id_list": [1]}})");
+  auto inChild = [](const std::function<int()>& body) {
+    const pid_t child = fork();
+    if (child == 0) _exit(body());
+    int status = 0;
+    return waitpid(child, &status, 0) == child && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  };
+  // Every id nobody's: no raise is possible. The gate would refuse first,
+  // so the action is called past it.
+  EXPECT_EQ(inChild([&] {
+    if (setresgid(65534, 65534, 65534) != 0 || setresuid(65534, 65534, 65534) != 0) return 10;
+    LogCapture log;
+    VELT::APIRequest request("VELT.Plovo", 1, "get_log_list", params);
+    VELT::APIResponse response;
+    PlovoHandle(&request, &response).HandleAction();
+    if (response.GetErrorCode() != 401) return 11;
+    for (const LogCapture::Line& line : log.Lines()) {
+      if (line.text.find("log-list.cpp:") != std::string::npos &&
+          line.text.find(" Failed to run as root") != std::string::npos) {
+        return 0;
+      }
+    }
+    return 12;
+  }), 0);
+  // Effective ids nobody's, real and saved root's, as a server that dropped
+  // its privileges: the database is made as root, and the thread is
+  // nobody again after the request.
+  EXPECT_EQ(inChild([&] {
+    if (setresgid(0, 65534, 0) != 0 || setresuid(0, 65534, 0) != 0) return 10;
+    if (!Call("get_log_list", params).IsSuccess()) return 11;
+    return geteuid() == 65534 && getegid() == 65534 ? 0 : 12;
+  }), 0);
+  struct stat st {};
+  ASSERT_EQ(stat(Path("/volume1/@Plovo/db/log-db.sqlite").c_str(), &st), 0);
+  EXPECT_EQ(st.st_uid, 0u);
+  EXPECT_EQ(st.st_gid, 0u);
 }
 
 }  // namespace
