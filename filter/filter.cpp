@@ -89,7 +89,10 @@ int WriteRecord(const char* path, const Record* record, int (*print)(FILE*, cons
     unlink(temporary.c_str());
     return -1;
   }
-  bool ok = fchmod(fd, 0644) == 0 && print(stream, record) == 0 && fflush(stream) == 0 && fsync(fd) == 0;
+  // A list longer than the reader takes would be written and then never
+  // read, and a black list that does not load lets everything through.
+  bool ok = fchmod(fd, 0644) == 0 && print(stream, record) == 0 && fflush(stream) == 0 &&
+            ftello(stream) <= static_cast<off_t>(kFilterFileMax) && fsync(fd) == 0;
   ok = fclose(stream) == 0 && ok;
   ok = ok && rename(temporary.c_str(), path) == 0;
   if (!ok) {

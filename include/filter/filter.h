@@ -82,7 +82,8 @@ int filter_read(const char* path, black_list_filter* filter);
 int filter_print(FILE* stream, const black_list_filter* filter);
 // Prints into a new file (mode 0644) beside path, syncs it, renames it over
 // path and syncs the folder, so that a reader, also after a power cut, sees
-// the old file or the whole new one. 0; or -1 with the old file in place and
+// the old file or the whole new one. A text longer than kFilterFileMax,
+// which no reader takes, is not written. 0; or -1 with the old file in place and
 // no temporary left, except when only the folder's sync failed: the new
 // file is then in place but may not survive a power cut.
 int filter_write(const char* path, const black_list_filter* filter);

@@ -52,6 +52,7 @@ TEST_F(FileFilterTest, ListsFailOnlyWhenTheyCannotBeWrittenOrParsed) {
   WriteFile("/target/kept", "old");  // a folder in the target's place: the rename fails
   EXPECT_EQ(-1, WriteBlackList(Path("/black.filter"), {""}, {}));
   EXPECT_EQ(-1, WriteBlackList(Path("/black.filter"), {std::string(256, '$')}, {}));  // cannot print whole
+  EXPECT_EQ(-1, WriteBlackList(Path("/black.filter"), Strings(1100, std::string(1000, 'n')), {}));  // never read
   EXPECT_EQ(-1, WriteWhiteList(Path("/no/such/folder/white.filter"), {"a"}, {}));
   EXPECT_EQ(-1, WriteBlackList(Path("/target"), {"a"}, {}));
   EXPECT_EQ(-1, WriteWhiteList(Path("/target"), {"a"}, {}));
