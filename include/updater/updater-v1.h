@@ -1,0 +1,51 @@
+// Brings a task database of schema version 1 to version 2: the task table
+// gains rename_photo_video (the old rename_photo_file), remove_src_file,
+// enable_rotation, max_version_count, rotation_policy and schedule_id; every
+// task outside the default devices gets a disabled scheduler entry; the
+// file database of each incremental task gets its path indexes replaced.
+//
+// Every database is changed on a working copy (its path + ".bkp_v1") that
+// replaces the live file only when the whole change succeeded; the file
+// databases go first, while the task database still says version 1, so a
+// failure anywhere leaves every live database as it was and the next start
+// tries again. Scheduler entries made before a failure stay.
+//
+// Results are 0 or -1; failures are logged as "[ERR] updater-v1(<line>): ...".
+#ifndef PLOVO_UPDATER_UPDATER_V1_H
+#define PLOVO_UPDATER_UPDATER_V1_H
+
+#include <cstdint>
+#include <string>
+
+#include "common/registry.h"
+#include "updater/updater-base.h"
+
+// The columns of a version 1 task row the migration reads.
+struct TaskInfoV1 {
+  uint64_t id = 0;
+  uint64_t usb_id = 0;
+  std::string task_name;
+  Registry::TASK_TYPE task_type = Registry::TASK_TYPE_UNKNOWN;
+};
+
+class UpdaterV1 : public UpdaterBase {
+ public:
+  explicit UpdaterV1(const std::string& repoPath) : UpdaterBase(repoPath) {}
+  ~UpdaterV1() override {}
+
+  // True exactly for version 1.
+  static bool IsNeedV1Update(unsigned int version);
+  // The whole migration of the repository's databases; 0 also when the task
+  // database needs none.
+  virtual int Run();
+
+  // Every incremental task's file database, then one by path.
+  int UpdateFileDB();
+  int UpdateFileDB(const std::string& path);
+  // The task database at path, with the tasks' scheduler entries.
+  int UpdateTaskDB(const std::string& path);
+  // True for the devices of the default tasks, which get no scheduler entry.
+  static bool IsDefaultTask(const std::string& uuid);
+};
+
+#endif
