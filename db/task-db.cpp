@@ -4,6 +4,7 @@
 
 #include "common/log.h"
 #include "db/sqlite-owner.h"
+#include "db/task-db-schema.h"
 
 using Plovo::ScopedDBLock;
 using Plovo::SqliteStatement;
@@ -34,36 +35,12 @@ constexpr const char* kSchema =
     " eject_when_task_done INTEGER NOT NULL,"
     " producer TEXT NOT NULL,"
     " product TEXT NOT NULL);"
-    "CREATE TABLE IF NOT EXISTS task_info_table ("
-    " id INTEGER PRIMARY KEY AUTOINCREMENT,"
-    " usb_id INTEGER NOT NULL,"
-    " is_enable INTEGER NOT NULL,"
-    " task_name TEXT NOT NULL,"
-    " task_type INTEGER NOT NULL,"
-    " usb_folder_path TEXT NOT NULL,"
-    " nas_folder_path TEXT NOT NULL,"
-    " nas_share_name TEXT NOT NULL,"
-    " last_copied_time INTEGER NOT NULL,"
-    " copy_strategy INTEGER NOT NULL,"
-    " keep_dir_structure INTEGER NOT NULL,"
-    " smart_create_date_dir INTEGER NOT NULL,"
-    " rename_photo_video INTEGER NOT NULL,"
-    " remove_src_file INTEGER NOT NULL,"
-    " conflict_policy INTEGER NOT NULL,"
-    " enable_rotation INTEGER NOT NULL,"
-    " max_version_count INTEGER NOT NULL,"
-    " rotation_policy INTEGER NOT NULL,"
-    " schedule_id INTEGER DEFAULT -1,"
-    " error INTEGER NOT NULL);"
+    PLOVO_TASK_INFO_TABLE
     "CREATE INDEX IF NOT EXISTS usb_info_table_uuid_idx on usb_info_table(uuid);"
-    "CREATE INDEX IF NOT EXISTS task_info_table_usb_id_idx on task_info_table(usb_id);"
-    "CREATE INDEX IF NOT EXISTS task_info_table_nas_share_name_idx on task_info_table(nas_share_name);"
+    PLOVO_TASK_INFO_INDEXES
     "INSERT or IGNORE into config_table VALUES ('version', 2);"
-    "CREATE TRIGGER IF NOT EXISTS usb_info_delete_trigger AFTER DELETE ON usb_info_table"
-    " BEGIN DELETE FROM task_info_table WHERE usb_id = OLD.id; END;"
-    "CREATE TRIGGER IF NOT EXISTS task_info_delete_trigger AFTER DELETE ON task_info_table"
-    " BEGIN DELETE FROM usb_info_table WHERE id = OLD.usb_id AND"
-    " (0 = (SELECT COUNT(*) FROM task_info_table WHERE usb_id = OLD.usb_id)); END;"
+    PLOVO_USB_INFO_DELETE_TRIGGER
+    PLOVO_TASK_INFO_DELETE_TRIGGER
     "COMMIT;";
 
 constexpr const char* kUSBSelect =

@@ -68,8 +68,10 @@ int BackupDB(const std::string& live, const std::string& copy);
 // live database keeps its content.
 int ReplaceDB(const std::string& copy, const std::string& live);
 
-// Removes a database file with its "-wal", "-shm" and "-journal" files.
-void RemoveDBFiles(const std::string& path);
+// Removes a database file with its "-wal", "-shm" and "-journal" files. 0,
+// or -1 when one of them exists and cannot be removed (a folder in the
+// place of a working copy, say).
+int RemoveDBFiles(const std::string& path);
 
 // For tests: the next ReplaceDB fails at the named step ("checkpoint",
 // "sync" or "rename") as if the system call had failed. "" clears it.

@@ -4,17 +4,20 @@
 // task outside the default devices gets a disabled scheduler entry; the
 // file database of each incremental task gets its path indexes replaced.
 //
-// Every database is changed on a working copy (its path + ".bkp_v1") that
-// replaces the live file only when the whole change succeeded; the file
-// databases go first, while the task database still says version 1, so a
-// failure anywhere leaves every live database as it was and the next start
-// tries again. Scheduler entries made before a failure stay.
+// Every database is changed on a working copy (its path + ".bkp_v1"). Run
+// prepares all of them, the file databases first (so that a failure there
+// leaves the scheduler alone), and only then puts them in the live files'
+// place: the file databases, then the task database, whose version 2 marks
+// the migration done. A failure before that leaves every live database as
+// it was and the next start tries again. Scheduler entries made before a
+// failure stay.
 //
 // Results are 0 or -1; failures are logged as "[ERR] updater-v1(<line>): ...".
 #ifndef PLOVO_UPDATER_UPDATER_V1_H
 #define PLOVO_UPDATER_UPDATER_V1_H
 
 #include <cstdint>
+#include <list>
 #include <string>
 
 #include "common/registry.h"
@@ -46,6 +49,17 @@ class UpdaterV1 : public UpdaterBase {
   int UpdateTaskDB(const std::string& path);
   // True for the devices of the default tasks, which get no scheduler entry.
   static bool IsDefaultTask(const std::string& uuid);
+
+ private:
+  // The ids of the incremental tasks, whose file databases change.
+  int ListIncrementalTasks(const std::string& taskDB, std::list<uint64_t>& ids);
+  // The file database exists and has a version.
+  int CheckFileDB(const std::string& path);
+  // The changed working copy of a database, the live file untouched.
+  int PrepareFileDB(const std::string& path, const std::string& copy);
+  int PrepareTaskDB(const std::string& path, const std::string& copy);
+  // The working copy in the live file's place.
+  int MoveBack(const std::string& copy, const std::string& live);
 };
 
 #endif
