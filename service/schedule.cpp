@@ -4,6 +4,7 @@
 #include <velt/sched.h>
 
 #include <memory>
+#include <utility>
 
 #include "common/log.h"
 #include "common/paths.h"
@@ -13,6 +14,13 @@ namespace Plovo {
 const char* const kScheduleApp = "VELT.QXS.Plovo.Application";
 
 namespace {
+
+// The scheduler keeps each entry in a file of its own, read whole when the
+// package's entries are listed: one entry too large to read would stop
+// show, hide and remove for every entry. Task names and timetables are far
+// shorter than these.
+constexpr size_t kMaxNameBytes = 1024;
+constexpr size_t kMaxTimetableBytes = 16 * 1024;
 
 struct SchedTaskFree {
   void operator()(PVELTSCHEDTASK task) const { VELTSchedTaskFree(task); }
@@ -43,19 +51,23 @@ std::string CompactJson(const Json::Value& value) {
 // The web interface's timetable in the scheduler's words, set on task.
 bool ConvertScheduleJson(const std::string& scheduleJson, PVELTSCHEDTASK task) {
   Json::CharReaderBuilder builder;
+  Json::CharReaderBuilder::strictMode(&builder.settings_);
   std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value input;
   std::string errors;
   const char* begin = scheduleJson.data();
-  if (!reader->parse(begin, begin + scheduleJson.size(), &input, &errors) || !input.isObject()) {
+  if (scheduleJson.size() > kMaxTimetableBytes ||
+      !reader->parse(begin, begin + scheduleJson.size(), &input, &errors) || !input.isObject()) {
     PLOVO_LIB_ERR("parse json[%s] failed\n", scheduleJson.c_str());
     return false;
   }
   Json::Value converted(Json::objectValue);
   Json::Value& schedule = converted["schedule"] = input;
-  schedule["min"] = input.get("minute", Json::Value());
-  schedule["week_name"] = input.get("week_day", Json::Value());
-  schedule["repeat"] = input.get("repeat_date", Json::Value());
+  for (const auto& [from, to] : {std::pair<const char*, const char*>{"minute", "min"},
+                                 {"week_day", "week_name"},
+                                 {"repeat_date", "repeat"}}) {
+    if (input.isMember(from)) schedule[to] = input[from];
+  }
   schedule.removeMember("minute");
   if (VELTSchedTaskConvertFromJson_Schedule(converted, task) < 0) {
     PLOVO_LIB_ERR("VELTSchedTaskConvertFromJson_Schedule() failed, converted_json[%s]\n",
@@ -110,6 +122,14 @@ SchedTask LoadEntry(int64_t scheduleId) {
   return task;
 }
 
+bool IsUsableName(const std::string& name) {
+  if (name.size() > kMaxNameBytes || name.find('\0') != std::string::npos) {
+    PLOVO_LIB_ERR("Invalid schedule name of %zu bytes\n", name.size());
+    return false;
+  }
+  return true;
+}
+
 bool SaveEntry(PVELTSCHEDTASK task) {
   if (VELTSchedTaskSave(task) < 0) {
     PLOVO_LIB_ERR("VELTSchedTaskSave() failed.\n");
@@ -122,6 +142,7 @@ bool SaveEntry(PVELTSCHEDTASK task) {
 
 bool CreateSchedule(unsigned long taskId, int taskType, const std::string& name, bool enabled,
                     const std::string& scheduleJson, int64_t& scheduleId) {
+  if (!IsUsableName(name)) return false;
   SchedTask task(VELTSchedTaskAlloc());
   if (!task) {
     PLOVO_LIB_ERR("VELTSchedTaskAlloc() failed\n");
@@ -164,6 +185,7 @@ bool CreateSchedule(unsigned long taskId, int taskType, const std::string& name,
 }
 
 bool UpdateScheduleName(int64_t scheduleId, const std::string& name) {
+  if (!IsUsableName(name)) return false;
   SchedTask task = LoadEntry(scheduleId);
   if (!task) return false;
   if (VELTSchedCTaskSetName(task.get(), name.c_str()) < 0) {
@@ -185,6 +207,14 @@ bool UpdateScheduleContent(int64_t scheduleId, bool enabled, const std::string& 
     return false;
   }
   return SaveEntry(task.get());
+}
+
+bool RemoveSchedule(int64_t scheduleId) {
+  if (VELTSchedTaskRemove(scheduleId) < 0) {
+    PLOVO_LIB_ERR("VELTSchedTaskRemove() failed.\n");
+    return false;
+  }
+  return true;
 }
 
 bool ShowAllSchedule() { return SetAllListable(true); }

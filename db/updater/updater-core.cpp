@@ -1,14 +1,20 @@
 #include "updater/updater-core.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <velt/vlibc.h>
 
-#include <fstream>
+#include <cerrno>
+#include <cstring>
 #include <string>
 #include <vector>
 
+#include "common/error-text.h"
 #include "common/file-op.h"
 #include "common/log.h"
 #include "common/paths.h"
+#include "common/unique-fd.h"
 #include "filter/file-filter.h"
 #include "updater/updater-utils.h"
 #include "updater/updater-v1.h"
@@ -23,15 +29,23 @@ std::string TaskDBPath(const std::string& repoPath) { return repoPath + "/db/" +
 // The line Json::FastWriter gives for an object with two empty arrays.
 const char* const kDefaultUserConfig = "{\"user_defined_extensions\":[],\"user_defined_names\":[]}\n";
 
+// Written as root into the repository: a symbolic link planted in the
+// file's place is refused rather than followed.
 int WriteUserConfig(const std::string& path) {
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out << kDefaultUserConfig;
-  out.close();
-  if (!out) {
-    PLOVO_LIB_ERR("Failed to write '%s'\n", path.c_str());
+  Plovo::UniqueFd fd(open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644));
+  const size_t size = std::strlen(kDefaultUserConfig);
+  if (fd.get() < 0 || write(fd.get(), kDefaultUserConfig, size) != static_cast<ssize_t>(size)) {
+    PLOVO_LIB_ERR("Failed to write '%s': %s\n", path.c_str(), Plovo::ErrorText(errno).c_str());
     return -1;
   }
   return 0;
+}
+
+// A folder, not a symbolic link to one: the task's files must not land
+// outside the repository.
+bool IsRealFolder(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
 }
 
 }  // namespace
@@ -81,6 +95,14 @@ int UpdaterCore::PrepareDefaultTask(const std::string& repoPath, const std::stri
     PLOVO_LIB_DBG("Not support '%s'\n", supportKey.c_str());
     return 0;
   }
+  // Read before the database is made: a new install that fails here leaves
+  // no database behind, so the next start is a new install again.
+  const std::string infoFile = Plovo::Path::PlatformInfoFile();
+  char folder[kKeyValueSize] = {0};
+  if (VLIBCFileGetKeyValue(infoFile.c_str(), folderKey.c_str(), folder, sizeof(folder), 0) == -1) {
+    PLOVO_LIB_ERR("Failed to get old copy folder for key '%s'\n", folderKey.c_str());
+    return -1;
+  }
   const std::string path = TaskDBPath(repoPath);
   TaskDB db;
   if (db.Initialize(path) < 0) {
@@ -96,12 +118,6 @@ int UpdaterCore::PrepareDefaultTask(const std::string& repoPath, const std::stri
   if (found == 1) {
     PLOVO_LIB_DBG("default task '%s' already exist\n", uuid.c_str());
     return 0;
-  }
-  const std::string infoFile = Plovo::Path::PlatformInfoFile();
-  char folder[kKeyValueSize] = {0};
-  if (VLIBCFileGetKeyValue(infoFile.c_str(), folderKey.c_str(), folder, sizeof(folder), 0) == -1) {
-    PLOVO_LIB_ERR("Failed to get old copy folder for key '%s'\n", folderKey.c_str());
-    return -1;
   }
   const std::string shareName = folder;
   if (shareName.empty()) {
@@ -186,7 +202,10 @@ int UpdaterCore::CreateDefaultTaskInfo(TaskDB& db, unsigned long usbId, const st
 }
 
 int UpdaterCore::CreateDefaultTaskFilter(const std::string& taskDir) {
-  if (FSMKDir(taskDir, true, static_cast<unsigned>(-1), static_cast<unsigned>(-1)) < 0) {
+  const std::string tasksDir = taskDir.substr(0, taskDir.find_last_of('/'));
+  if ((IsFileExist(tasksDir) && !IsRealFolder(tasksDir)) ||
+      FSMKDir(taskDir, true, static_cast<unsigned>(-1), static_cast<unsigned>(-1)) < 0 ||
+      !IsRealFolder(taskDir)) {
     PLOVO_LIB_ERR("Failed to create task folder '%s'\n", taskDir.c_str());
     return -1;
   }

@@ -1,8 +1,10 @@
 #include "updater/updater-utils.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <cctype>
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
@@ -24,11 +26,13 @@ constexpr int kBusyTimeoutMs = 300000;
 
 std::mutex gFaultMutex;
 std::string gFaultStep;
+int gFaultCountdown = 0;
 
-// True, once, when a test asked this step of ReplaceDB to fail.
+// True, once, when a test asked this step of ReplaceDB to fail and this is
+// the pass it named.
 bool FaultAt(const char* step) {
   std::lock_guard<std::mutex> lock(gFaultMutex);
-  if (gFaultStep != step) return false;
+  if (gFaultStep != step || --gFaultCountdown > 0) return false;
   gFaultStep.clear();
   errno = EIO;
   return true;
@@ -149,7 +153,9 @@ int GetDBVersion(const std::string& path, unsigned int& version) {
   char* end = nullptr;
   errno = 0;
   unsigned long parsed = std::strtoul(text.c_str(), &end, 10);
-  if (text.empty() || *end != '\0' || text[0] == '-' || errno != 0 || parsed > UINT_MAX) {
+  // strtoul would also take blanks and a sign before the digits.
+  if (text.empty() || !std::isdigit(static_cast<unsigned char>(text[0])) || *end != '\0' ||
+      errno != 0 || parsed > UINT_MAX) {
     PLOVO_LIB_ERR("Invalid db version '%s' at '%s'\n", text.c_str(), path.c_str());
     return -1;
   }
@@ -219,9 +225,16 @@ int BackupDB(const std::string& live, const std::string& copy) {
   return 0;
 }
 
-int ReplaceDB(const std::string& copy, const std::string& live) {
+int ReplaceDB(const std::string& copy, const std::string& live, const std::string& keep) {
   // The copy must stand alone before it is the database: its whole content
-  // in its main file, on disk.
+  // in its main file, on disk, with the live file's owner and mode.
+  struct stat liveStat;
+  if (lstat(live.c_str(), &liveStat) != 0 || chown(copy.c_str(), liveStat.st_uid, liveStat.st_gid) != 0 ||
+      chmod(copy.c_str(), liveStat.st_mode & 07777) != 0) {
+    PLOVO_LIB_ERR("Failed to give '%s' the owner and mode of '%s': %s\n", copy.c_str(), live.c_str(),
+                  Plovo::ErrorText(errno).c_str());
+    return -1;
+  }
   if (Checkpoint(copy) != 0 || RemoveFile(copy + "-wal") != 0 || RemoveFile(copy + "-shm") != 0 ||
       SyncPath(copy, 0) != 0) {
     return -1;
@@ -232,14 +245,31 @@ int ReplaceDB(const std::string& copy, const std::string& live) {
   if (Checkpoint(live) != 0 || RemoveFile(live + "-wal") != 0 || RemoveFile(live + "-shm") != 0) {
     return -1;
   }
+  if (!keep.empty() && (RemoveDBFiles(keep) != 0 || link(live.c_str(), keep.c_str()) != 0)) {
+    PLOVO_LIB_ERR("Failed to keep '%s' as '%s': %s\n", live.c_str(), keep.c_str(), Plovo::ErrorText(errno).c_str());
+    return -1;
+  }
   if (FaultAt("rename") || FSRename(copy, live) != 0) {
     PLOVO_LIB_ERR("Failed to rename '%s' -> '%s'\n", copy.c_str(), live.c_str());
+    if (!keep.empty()) RemoveFile(keep);
+    return -1;
+  }
+  // The new database is in place: a folder that cannot be synced only means
+  // that a power cut could still bring back the old one, which is whole too.
+  SyncPath(FolderOf(live), O_DIRECTORY);
+  return 0;
+}
+
+int RestoreDB(const std::string& keep, const std::string& live) {
+  if (RemoveFile(live + "-wal") != 0 || RemoveFile(live + "-shm") != 0 || FSRename(keep, live) != 0) {
+    PLOVO_LIB_ERR("Failed to put back '%s' -> '%s'\n", keep.c_str(), live.c_str());
     return -1;
   }
   return SyncPath(FolderOf(live), O_DIRECTORY);
 }
 
-void FailReplaceDBStepForTest(const std::string& step) {
+void FailReplaceDBStepForTest(const std::string& step, int nth) {
   std::lock_guard<std::mutex> lock(gFaultMutex);
   gFaultStep = step;
+  gFaultCountdown = nth;
 }

@@ -4,6 +4,7 @@
 
 #include <list>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "common/file-op.h"
@@ -16,6 +17,8 @@
 namespace {
 
 const char* const kWorkingCopySuffix = ".bkp_v1";
+// Where a replaced file database waits until the task database is replaced.
+const char* const kKeptSuffix = ".old_v1";
 
 // The old path indexes of a file database give way to the names the copy
 // engine creates.
@@ -92,20 +95,22 @@ int DefaultScheduleContent(std::string& content) {
   return 0;
 }
 
-// Removes the working copies whatever happened: after a successful
-// replace there is nothing left to remove.
+// Removes the working copies and the kept old files whatever happened:
+// after a successful replace there is no copy left, and a kept file that
+// was put back is gone too.
 class WorkingCopies {
  public:
   ~WorkingCopies() {
-    for (const std::string& copy : copies_) RemoveDBFiles(copy);
+    for (const std::string& file : files_) RemoveDBFiles(file);
   }
   const std::string& Add(const std::string& live) {
-    copies_.push_back(WorkingCopy(live));
-    return copies_.back();
+    files_.push_back(WorkingCopy(live));
+    return files_.back();
   }
+  void AddKept(const std::string& kept) { files_.push_back(kept); }
 
  private:
-  std::list<std::string> copies_;  // references stay valid as copies are added
+  std::list<std::string> files_;  // references stay valid as files are added
 };
 
 }  // namespace
@@ -131,43 +136,71 @@ int UpdaterV1::Run() {
     PLOVO_LIB_INFO("UpdaterV1: task_db_version (%u) \n", version);
     return 0;
   }
+  createdSchedules_.clear();
+  return Finish(MigrateAll(path));
+}
+
+int UpdaterV1::Finish(int rc) {
+  // A failed attempt takes back the entries it made: the next start makes
+  // them again, and twins would run the same task.
+  if (rc != 0) {
+    for (int64_t id : createdSchedules_) Plovo::RemoveSchedule(id);
+  }
+  createdSchedules_.clear();
+  return rc;
+}
+
+int UpdaterV1::MigrateAll(const std::string& path) {
   // Every working copy is made and changed before any live file is
   // replaced, so that a failure up to then leaves every database as it was.
-  // The task database goes last: its version 2 says the migration is done,
-  // and a file database replaced before a later failure is changed again,
-  // harmlessly, on the next start.
+  // The task database goes last: its version 2 says the migration is done.
+  // The file databases replaced before it are kept aside until then and put
+  // back if it fails.
   WorkingCopies copies;
   std::list<uint64_t> ids;
-  std::vector<std::string> fileDBs;
   if (ListIncrementalTasks(path, ids) != 0) {
     PLOVO_LIB_ERR("UpdaterV1: Failed to update file db\n");
     return -1;
   }
+  std::vector<std::pair<uint64_t, std::string>> fileDBs;
   for (uint64_t id : ids) {
     std::string fileDB = FileDBPath(GetRepoPath(), id);
-    if (CheckFileDB(fileDB) != 0 || PrepareFileDB(fileDB, copies.Add(fileDB)) != 0) {
+    if (CheckFileDB(fileDB) != 0) {
+      PLOVO_LIB_ERR("UpdaterV1: Failed to update file db\n");
+      return -1;
+    }
+    if (PrepareFileDB(fileDB, copies.Add(fileDB)) != 0) {
       PLOVO_LIB_ERR("UpdaterV1: Failed to update file db for task '%lu'\n", static_cast<unsigned long>(id));
       PLOVO_LIB_ERR("UpdaterV1: Failed to update file db\n");
       return -1;
     }
-    fileDBs.push_back(fileDB);
+    fileDBs.emplace_back(id, fileDB);
   }
   const std::string& taskCopy = copies.Add(path);
   if (PrepareTaskDB(path, taskCopy) != 0) {
     PLOVO_LIB_ERR("UpdaterV1: Failed to update task db '%s'\n", path.c_str());
     return -1;
   }
-  for (const std::string& fileDB : fileDBs) {
-    if (MoveBack(WorkingCopy(fileDB), fileDB) != 0) {
+  std::vector<std::string> replaced;
+  int rc = 0;
+  for (const auto& [id, fileDB] : fileDBs) {
+    copies.AddKept(fileDB + kKeptSuffix);
+    if (MoveBack(WorkingCopy(fileDB), fileDB, fileDB + kKeptSuffix) != 0) {
+      PLOVO_LIB_ERR("UpdaterV1: Failed to update file db for task '%lu'\n", static_cast<unsigned long>(id));
       PLOVO_LIB_ERR("UpdaterV1: Failed to update file db\n");
-      return -1;
+      rc = -1;
+      break;
     }
+    replaced.push_back(fileDB);
   }
-  if (MoveBack(taskCopy, path) != 0) {
+  if (rc == 0 && MoveBack(taskCopy, path) != 0) {
     PLOVO_LIB_ERR("UpdaterV1: Failed to update task db '%s'\n", path.c_str());
-    return -1;
+    rc = -1;
   }
-  return 0;
+  if (rc != 0) {
+    for (const std::string& fileDB : replaced) RestoreDB(fileDB + kKeptSuffix, fileDB);
+  }
+  return rc;
 }
 
 int UpdaterV1::UpdateFileDB() {
@@ -176,7 +209,8 @@ int UpdaterV1::UpdateFileDB() {
   if (ListIncrementalTasks(path, ids) != 0) return -1;
   for (uint64_t id : ids) {
     std::string fileDB = FileDBPath(GetRepoPath(), id);
-    if (CheckFileDB(fileDB) != 0 || UpdateFileDB(fileDB) != 0) {
+    if (CheckFileDB(fileDB) != 0) return -1;
+    if (UpdateFileDB(fileDB) != 0) {
       PLOVO_LIB_ERR("UpdaterV1: Failed to update file db for task '%lu'\n", static_cast<unsigned long>(id));
       return -1;
     }
@@ -192,10 +226,10 @@ int UpdaterV1::UpdateFileDB(const std::string& path) {
 }
 
 int UpdaterV1::UpdateTaskDB(const std::string& path) {
+  createdSchedules_.clear();
   WorkingCopies copies;
   const std::string& copy = copies.Add(path);
-  if (PrepareTaskDB(path, copy) != 0) return -1;
-  return MoveBack(copy, path);
+  return Finish(PrepareTaskDB(path, copy) == 0 ? MoveBack(copy, path) : -1);
 }
 
 int UpdaterV1::ListIncrementalTasks(const std::string& taskDB, std::list<uint64_t>& ids) {
@@ -258,6 +292,12 @@ int UpdaterV1::PrepareTaskDB(const std::string& path, const std::string& copy) {
   }
   for (const TaskInfoV1& task : tasks) {
     const unsigned long id = static_cast<unsigned long>(task.id);
+    // The notifier and the schedule id's update name the task by this
+    // number; a row of a damaged database without a real one gets neither.
+    if (static_cast<int64_t>(task.id) < 1) {
+      PLOVO_LIB_ERR("UpdaterV1: Invalid task id %lld\n", static_cast<long long>(task.id));
+      return -1;
+    }
     const unsigned long usbId = static_cast<unsigned long>(task.usb_id);
     std::string uuid;
     if (GetDBRecord<std::string>(
@@ -273,6 +313,7 @@ int UpdaterV1::PrepareTaskDB(const std::string& path, const std::string& copy) {
       PLOVO_LIB_ERR("UpdaterV1: Failed to CreateSchedule for task '%lu', '%s'\n", id, task.task_name.c_str());
       return -1;
     }
+    createdSchedules_.push_back(scheduleId);
     if (UpdateDB(copy, "UPDATE task_info_table SET schedule_id = " + std::to_string(scheduleId) +
                            " WHERE id = " + std::to_string(id) + " ;") != 0) {
       PLOVO_LIB_ERR("UpdaterV1: Failed to update schedule id for task '%lu', '%s'\n", id,
@@ -283,8 +324,8 @@ int UpdaterV1::PrepareTaskDB(const std::string& path, const std::string& copy) {
   return 0;
 }
 
-int UpdaterV1::MoveBack(const std::string& copy, const std::string& live) {
-  if (ReplaceDB(copy, live) != 0) {
+int UpdaterV1::MoveBack(const std::string& copy, const std::string& live, const std::string& keep) {
+  if (ReplaceDB(copy, live, keep) != 0) {
     PLOVO_LIB_ERR("UpdaterV1: Failed to move DB back '%s' -> '%s'.\n", copy.c_str(), live.c_str());
     return -1;
   }

@@ -23,12 +23,16 @@ namespace Plovo {
 extern const char* const kScheduleApp;
 
 // A new entry for the task: named after it, the icon of its type, enabled
-// or not, on the timetable scheduleJson. scheduleId receives its id.
+// or not, on the timetable scheduleJson. scheduleId receives its id. Names
+// longer than 1024 bytes or holding a NUL, and timetables over 16 KiB, are
+// refused.
 bool CreateSchedule(unsigned long taskId, int taskType, const std::string& name, bool enabled,
                     const std::string& scheduleJson, int64_t& scheduleId);
 bool UpdateScheduleName(int64_t scheduleId, const std::string& name);
 // Sets the entry's state, then its timetable, in one save.
 bool UpdateScheduleContent(int64_t scheduleId, bool enabled, const std::string& scheduleJson);
+// Deletes one entry.
+bool RemoveSchedule(int64_t scheduleId);
 // Make every entry of the package listed (shown) or not (hidden) in the
 // scheduler's list. An entry already so is not saved again; one whose save
 // fails is skipped and the others are still changed. False only when the

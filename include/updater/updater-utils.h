@@ -61,21 +61,30 @@ int GetTimeStr(const std::string& format, std::string& out);
 int BackupDB(const std::string& live, const std::string& copy);
 
 // Puts a finished working copy in the live database's place so that a power
-// cut leaves either the old or the new database whole: the copy is
-// checkpointed and synced, the live database checkpointed and its "-wal" and
-// "-shm" removed (SQLite would replay an old "-wal" into the new file), the
-// copy renamed over it and the folder synced. 0 or -1; until the rename the
-// live database keeps its content.
-int ReplaceDB(const std::string& copy, const std::string& live);
+// cut leaves either the old or the new database whole: the copy gets the
+// live file's owner and mode and is checkpointed and synced, the live
+// database is checkpointed and its "-wal" and "-shm" removed (SQLite would
+// replay an old "-wal" into the new file), the copy renamed over it and the
+// folder synced. When keep is given, the old file stays there (a hard link)
+// for RestoreDB. 0 once the copy is renamed (a failing folder sync is only
+// logged), else -1; until the rename the live database keeps its content. No other connection may have the live database open: its writes
+// would go to the replaced file.
+int ReplaceDB(const std::string& copy, const std::string& live, const std::string& keep = "");
+
+// Puts the file kept by ReplaceDB back in the live database's place. 0 or -1.
+int RestoreDB(const std::string& keep, const std::string& live);
 
 // Removes a database file with its "-wal", "-shm" and "-journal" files. 0,
 // or -1 when one of them exists and cannot be removed (a folder in the
 // place of a working copy, say).
 int RemoveDBFiles(const std::string& path);
 
-// For tests: the next ReplaceDB fails at the named step ("checkpoint",
-// "sync" or "rename") as if the system call had failed. "" clears it.
-void FailReplaceDBStepForTest(const std::string& step);
+// For tests: ReplaceDB fails, once, the nth time from now that it reaches
+// the named step, as if the system call had failed. Each ReplaceDB passes
+// "checkpoint" twice (the copy, then the live file), "sync" twice (the
+// copy, then the folder after the rename, which does not fail the call)
+// and "rename" once. "" clears it.
+void FailReplaceDBStepForTest(const std::string& step, int nth = 1);
 
 // ---- template definitions ----
 

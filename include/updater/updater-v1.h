@@ -7,10 +7,11 @@
 // Every database is changed on a working copy (its path + ".bkp_v1"). Run
 // prepares all of them, the file databases first (so that a failure there
 // leaves the scheduler alone), and only then puts them in the live files'
-// place: the file databases, then the task database, whose version 2 marks
-// the migration done. A failure before that leaves every live database as
-// it was and the next start tries again. Scheduler entries made before a
-// failure stay.
+// place: the file databases (the old files kept aside), then the task
+// database, whose version 2 marks the migration done. A failure leaves
+// every live database as it was (replaced file databases are put back),
+// takes back the scheduler entries the attempt made, and the next start
+// tries again. No other connection may have the databases open.
 //
 // Results are 0 or -1; failures are logged as "[ERR] updater-v1(<line>): ...".
 #ifndef PLOVO_UPDATER_UPDATER_V1_H
@@ -19,6 +20,7 @@
 #include <cstdint>
 #include <list>
 #include <string>
+#include <vector>
 
 #include "common/registry.h"
 #include "updater/updater-base.h"
@@ -58,8 +60,16 @@ class UpdaterV1 : public UpdaterBase {
   // The changed working copy of a database, the live file untouched.
   int PrepareFileDB(const std::string& path, const std::string& copy);
   int PrepareTaskDB(const std::string& path, const std::string& copy);
-  // The working copy in the live file's place.
-  int MoveBack(const std::string& copy, const std::string& live);
+  // Run's work once the task database is known to be at version 1.
+  int MigrateAll(const std::string& path);
+  // rc, after removing the scheduler entries of a failed attempt.
+  int Finish(int rc);
+  // The working copy in the live file's place (the old file kept at keep
+  // when given).
+  int MoveBack(const std::string& copy, const std::string& live, const std::string& keep = "");
+
+  // The scheduler entries made by the running attempt.
+  std::vector<int64_t> createdSchedules_;
 };
 
 #endif

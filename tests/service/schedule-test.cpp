@@ -84,17 +84,21 @@ TEST_F(ScheduleTest, FailuresAreLoggedAndReported) {
   int64_t id = -1, newId = -1;
   ASSERT_TRUE(Plovo::CreateSchedule(5, 1, "Daily", true, kTimetable, id));
   enum Op { kCreate, kName, kContent };
-  // fail: the platform call made to fail, if any; "[1,3]" is JSON but no timetable.
-  struct Case { Op op; const char* fail; const char* line; };
-  for (const Case& c : {Case{kCreate, "VELTSchedTaskSave", "VELTSchedTaskSave() failed"},
-                        Case{kName, "VELTSchedTaskLoad", "VELTSchedTaskLoad() failed."},
-                        Case{kName, "VELTSchedTaskSave", "VELTSchedTaskSave() failed."},
-                        Case{kContent, nullptr, "ConvertScheduleJson() failed."}}) {
+  // fail: the platform call made to fail, if any; arg: the name or the
+  // timetable ("[1,3]" is JSON but no timetable; trailing text is refused).
+  struct Case { Op op; const char* fail; std::string arg; const char* line; };
+  for (const Case& c : {Case{kCreate, "VELTSchedTaskSave", kTimetable, "VELTSchedTaskSave() failed"},
+                        Case{kCreate, nullptr, std::string(1025, 'n'), "Invalid schedule name of 1025 bytes"},
+                        Case{kName, "VELTSchedTaskLoad", "n", "VELTSchedTaskLoad() failed."},
+                        Case{kName, "VELTSchedTaskSave", "n", "VELTSchedTaskSave() failed."},
+                        Case{kName, nullptr, std::string("a\0b", 3), "Invalid schedule name of 3 bytes"},
+                        Case{kContent, nullptr, "[1,3]", "ConvertScheduleJson() failed."},
+                        Case{kContent, nullptr, std::string(kTimetable) + " x", "ConvertScheduleJson() failed."}}) {
     plovo_test::LogCapture log;
     if (c.fail) VeltDevFailCall(c.fail, 1, 1, VLIBC_ERR_IO);
-    EXPECT_FALSE(c.op == kCreate ? Plovo::CreateSchedule(1, 2, "n", true, kTimetable, newId)
-                 : c.op == kName ? Plovo::UpdateScheduleName(id, "n")
-                                 : Plovo::UpdateScheduleContent(id, true, "[1,3]")) << c.line;
+    EXPECT_FALSE(c.op == kCreate ? Plovo::CreateSchedule(1, 2, c.arg, true, kTimetable, newId)
+                 : c.op == kName ? Plovo::UpdateScheduleName(id, c.arg)
+                                 : Plovo::UpdateScheduleContent(id, true, c.arg)) << c.line;
     EXPECT_TRUE(LastLogIs(log, c.line)) << c.line << "\n" << log.Dump();
   }
 }
