@@ -16,6 +16,7 @@
 #include "db/log-db.h"
 #include "db/task-db.h"
 #include "log-capture.h"
+#include "raw-db.h"
 #include "sandbox.h"
 
 namespace {
@@ -31,25 +32,7 @@ LogDB::LogInfoFilter All() {
   return filter;
 }
 
-// A connection of the test's own, to look at a file without the library.
-struct Raw {
-  explicit Raw(const std::string& path) { sqlite3_open(path.c_str(), &db); }
-  ~Raw() { sqlite3_close_v2(db); }
-  int Run(const std::string& sql) const { return sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr); }
-  // Every row of the query, columns joined by ' ' ("NULL" for null), rows by '\n'.
-  std::string Rows(const std::string& sql) const {
-    std::string rows;
-    sqlite3_exec(db, sql.c_str(), [](void* out, int n, char** values, char**) {
-      std::string& text = *static_cast<std::string*>(out);
-      for (int i = 0; i < n; ++i) {
-        text += (i ? " " : text.empty() ? "" : "\n") + std::string(values[i] ? values[i] : "NULL");
-      }
-      return 0;
-    }, &rows, nullptr);
-    return rows;
-  }
-  sqlite3* db = nullptr;
-};
+using Raw = plovo_test::RawDB;
 
 // Every table, index and trigger of a file by name, with the table it is on
 // and its columns; a table's as "name type", "null" when nullable,
