@@ -101,6 +101,10 @@ TEST_F(ScheduleTest, FailuresAreLoggedAndReported) {
                                  : Plovo::UpdateScheduleContent(id, true, c.arg)) << c.line;
     EXPECT_TRUE(LastLogIs(log, c.line)) << c.line << "\n" << log.Dump();
   }
+  plovo_test::LogCapture log;
+  EXPECT_FALSE(Plovo::CreateSchedule(1, 2, "n", true, "not json", newId));
+  EXPECT_TRUE(log.Contains(LOG_ERR, "parse json[not json] failed")) << log.Dump();
+  EXPECT_EQ(Entries().size(), 1u);  // no failed create left an entry
 }
 
 TEST_F(ScheduleTest, ShowHideAndRemoveTouchOnlyThePackageEntries) {
