@@ -103,7 +103,7 @@ TEST_F(ScheduleTest, FailuresAreLoggedAndReported) {
   }
   plovo_test::LogCapture log;
   EXPECT_FALSE(Plovo::CreateSchedule(1, 2, "n", true, "not json", newId));
-  EXPECT_TRUE(log.Contains(LOG_ERR, "parse json[not json] failed")) << log.Dump();
+  EXPECT_TRUE(log.Contains("[ERR] schedule(") && log.Contains("parse json[not json] failed")) << log.Dump();
   EXPECT_EQ(Entries().size(), 1u);  // no failed create left an entry
 }
 
