@@ -386,7 +386,7 @@ int FSRename(const std::string& source, const std::string& destination) {
   if (rename(source.c_str(), destination.c_str()) == 0) return 0;
   int err = errno;
   if (err != EXDEV) {
-    PLOVO_LIB_ERR("FSRename: rename(%s, %s): %s (%d)", source.c_str(), destination.c_str(),
+    PLOVO_LIB_ERR("FSRename: rename(%s, %s): %s (%d)\n", source.c_str(), destination.c_str(),
                   Plovo::ErrorText(err).c_str(), err);
     return err == ENAMETOOLONG ? -100 : -3;
   }

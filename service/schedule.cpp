@@ -209,14 +209,6 @@ bool UpdateScheduleContent(int64_t scheduleId, bool enabled, const std::string& 
   return SaveEntry(task.get());
 }
 
-bool RemoveSchedule(int64_t scheduleId) {
-  if (VELTSchedTaskRemove(scheduleId) < 0) {
-    PLOVO_LIB_ERR("VELTSchedTaskRemove() failed.\n");
-    return false;
-  }
-  return true;
-}
-
 bool ShowAllSchedule() { return SetAllListable(true); }
 
 bool HideAllSchedule() { return SetAllListable(false); }

@@ -96,10 +96,12 @@ int UpdaterCore::PrepareDefaultTask(const std::string& repoPath, const std::stri
     return 0;
   }
   // Read before the database is made: a new install that fails here leaves
-  // no database behind, so the next start is a new install again.
+  // no database behind, so the next start is a new install again. A
+  // settings file that does not exist holds no old copy folder.
   const std::string infoFile = Plovo::Path::PlatformInfoFile();
   char folder[kKeyValueSize] = {0};
-  if (VLIBCFileGetKeyValue(infoFile.c_str(), folderKey.c_str(), folder, sizeof(folder), 0) == -1) {
+  if (VLIBCFileGetKeyValue(infoFile.c_str(), folderKey.c_str(), folder, sizeof(folder), 0) == -1 &&
+      VLIBCErrGet() != VLIBC_ERR_NOT_FOUND) {
     PLOVO_LIB_ERR("Failed to get old copy folder for key '%s'\n", folderKey.c_str());
     return -1;
   }

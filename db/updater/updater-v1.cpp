@@ -108,6 +108,8 @@ class WorkingCopies {
     return files_.back();
   }
   void AddKept(const std::string& kept) { files_.push_back(kept); }
+  // Leaves the file in place.
+  void Release(const std::string& file) { files_.remove(file); }
 
  private:
   std::list<std::string> files_;  // references stay valid as files are added
@@ -136,18 +138,7 @@ int UpdaterV1::Run() {
     PLOVO_LIB_INFO("UpdaterV1: task_db_version (%u) \n", version);
     return 0;
   }
-  createdSchedules_.clear();
-  return Finish(MigrateAll(path));
-}
-
-int UpdaterV1::Finish(int rc) {
-  // A failed attempt takes back the entries it made: the next start makes
-  // them again, and twins would run the same task.
-  if (rc != 0) {
-    for (int64_t id : createdSchedules_) Plovo::RemoveSchedule(id);
-  }
-  createdSchedules_.clear();
-  return rc;
+  return MigrateAll(path);
 }
 
 int UpdaterV1::MigrateAll(const std::string& path) {
@@ -198,7 +189,10 @@ int UpdaterV1::MigrateAll(const std::string& path) {
     rc = -1;
   }
   if (rc != 0) {
-    for (const std::string& fileDB : replaced) RestoreDB(fileDB + kKeptSuffix, fileDB);
+    for (const std::string& fileDB : replaced) {
+      // Put back or not, the old file stays where it is kept until then.
+      if (RestoreDB(fileDB + kKeptSuffix, fileDB) != 0) copies.Release(fileDB + kKeptSuffix);
+    }
   }
   return rc;
 }
@@ -226,10 +220,10 @@ int UpdaterV1::UpdateFileDB(const std::string& path) {
 }
 
 int UpdaterV1::UpdateTaskDB(const std::string& path) {
-  createdSchedules_.clear();
   WorkingCopies copies;
   const std::string& copy = copies.Add(path);
-  return Finish(PrepareTaskDB(path, copy) == 0 ? MoveBack(copy, path) : -1);
+  if (PrepareTaskDB(path, copy) != 0) return -1;
+  return MoveBack(copy, path);
 }
 
 int UpdaterV1::ListIncrementalTasks(const std::string& taskDB, std::list<uint64_t>& ids) {
@@ -290,6 +284,13 @@ int UpdaterV1::PrepareTaskDB(const std::string& path, const std::string& copy) {
     PLOVO_LIB_ERR("UpdaterV1: Failed to get default schedule content\n");
     return -1;
   }
+  // A version 1 database names no scheduler entry: an entry of the
+  // package now was made by an attempt cut short by a crash or a power cut,
+  // and would run its task beside the one made below.
+  if (!Plovo::RemoveAllSchedule()) {
+    PLOVO_LIB_ERR("UpdaterV1: Failed to remove schedules of an earlier attempt\n");
+    return -1;
+  }
   for (const TaskInfoV1& task : tasks) {
     const unsigned long id = static_cast<unsigned long>(task.id);
     // The notifier and the schedule id's update name the task by this
@@ -313,7 +314,6 @@ int UpdaterV1::PrepareTaskDB(const std::string& path, const std::string& copy) {
       PLOVO_LIB_ERR("UpdaterV1: Failed to CreateSchedule for task '%lu', '%s'\n", id, task.task_name.c_str());
       return -1;
     }
-    createdSchedules_.push_back(scheduleId);
     if (UpdateDB(copy, "UPDATE task_info_table SET schedule_id = " + std::to_string(scheduleId) +
                            " WHERE id = " + std::to_string(id) + " ;") != 0) {
       PLOVO_LIB_ERR("UpdaterV1: Failed to update schedule id for task '%lu', '%s'\n", id,

@@ -31,8 +31,6 @@ bool CreateSchedule(unsigned long taskId, int taskType, const std::string& name,
 bool UpdateScheduleName(int64_t scheduleId, const std::string& name);
 // Sets the entry's state, then its timetable, in one save.
 bool UpdateScheduleContent(int64_t scheduleId, bool enabled, const std::string& scheduleJson);
-// Deletes one entry.
-bool RemoveSchedule(int64_t scheduleId);
 // Make every entry of the package listed (shown) or not (hidden) in the
 // scheduler's list. An entry already so is not saved again; one whose save
 // fails is skipped and the others are still changed. False only when the

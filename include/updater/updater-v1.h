@@ -9,9 +9,10 @@
 // leaves the scheduler alone), and only then puts them in the live files'
 // place: the file databases (the old files kept aside), then the task
 // database, whose version 2 marks the migration done. A failure leaves
-// every live database as it was (replaced file databases are put back),
-// takes back the scheduler entries the attempt made, and the next start
-// tries again. No other connection may have the databases open.
+// every live database as it was (replaced file databases are put back) and
+// the next start tries again; the scheduler entries it made stay until
+// then, when every entry of the package is removed before new ones are
+// made. No other connection may have the databases open.
 //
 // Results are 0 or -1; failures are logged as "[ERR] updater-v1(<line>): ...".
 #ifndef PLOVO_UPDATER_UPDATER_V1_H
@@ -20,7 +21,6 @@
 #include <cstdint>
 #include <list>
 #include <string>
-#include <vector>
 
 #include "common/registry.h"
 #include "updater/updater-base.h"
@@ -62,14 +62,9 @@ class UpdaterV1 : public UpdaterBase {
   int PrepareTaskDB(const std::string& path, const std::string& copy);
   // Run's work once the task database is known to be at version 1.
   int MigrateAll(const std::string& path);
-  // rc, after removing the scheduler entries of a failed attempt.
-  int Finish(int rc);
   // The working copy in the live file's place (the old file kept at keep
   // when given).
   int MoveBack(const std::string& copy, const std::string& live, const std::string& keep = "");
-
-  // The scheduler entries made by the running attempt.
-  std::vector<int64_t> createdSchedules_;
 };
 
 #endif
