@@ -229,6 +229,17 @@ TEST_F(UpdaterTest, MigratesAVersion1RepositoryWithRowsInTheWal) {
             "0 0 256 1 -1\n0 0 256 1 0");
   // Only the ordinary device's tasks get an entry, and it does not run.
   EXPECT_EQ(Entries(), (std::multiset<std::string>{"Cam 'daily' off", "Export 2 off", "Late off"}));
+  // Each of them names its entry, which runs it every day at 00:00.
+  std::istringstream rows(Rows(kTaskDB, "SELECT id, schedule_id FROM task_info_table WHERE usb_id = 5"));
+  for (std::string id, entry; rows >> id >> entry;) {
+    std::string text = ReadFile("/velt-dev/scheduler/" + entry + ".json");
+    Json::Value e;
+    ASSERT_TRUE(Json::Reader().parse(text, e)) << text;
+    EXPECT_EQ(e["command"].asString().substr(e["command"].asString().rfind(' ') + 1), id);
+    const Json::Value& when = e["schedule"];
+    EXPECT_EQ(when["week_name"].asString(), "0,1,2,3,4,5,6");
+    EXPECT_EQ(when["hour"].asInt() | when["min"].asInt() | when["repeat"].asInt(), 0) << text;
+  }
   for (int id : {1, 7}) {
     EXPECT_EQ(Rows(FileDB(id), "SELECT name FROM sqlite_master WHERE type = 'index' AND sql NOT NULL ORDER BY 1"),
               "file_info_dst_path_idx\nfile_info_src_path_idx");
