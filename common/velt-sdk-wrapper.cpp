@@ -37,6 +37,17 @@ int GetDevPath(const std::string& path, std::string& devPath) {
   return 0;
 }
 
+int PathGetShareBin(const std::string& volPath, std::string& path) {
+  char buffer[256];
+  path.clear();
+  if (VELTShareBinPathGet(volPath.c_str(), buffer, sizeof buffer) < 0) {
+    PLOVO_LIB_DBG("VELTShareBinPathGet(%s) failed, err=[0x%04X]", volPath.c_str(), VLIBCErrGet());
+    return -1;
+  }
+  path = buffer;
+  return 0;
+}
+
 int GetUUID(const std::string& path, const std::string& devPath, std::string& uuid) {
   char buffer[256];
   uuid.clear();

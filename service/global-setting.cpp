@@ -9,7 +9,7 @@
 namespace Plovo {
 namespace {
 
-constexpr size_t kRepoPathSize = 64;
+constexpr size_t kRepoPathSize = GlobalSetting::kMaxRepoVolumePath + 1;
 constexpr size_t kBeepSize = 5;
 
 void LogReadFailure(const char* file, int line) {

@@ -1,22 +1,36 @@
 #include "service/service-ctrl.h"
 
 #include <fcntl.h>
+#include <signal.h>
 #include <sys/file.h>
 #include <sys/stat.h>
+#include <unistd.h>
+#include <velt/log.h>
 #include <velt/mount.h>
 #include <velt/vlibc.h>
 
 #include <atomic>
 #include <cerrno>
 #include <chrono>
+#include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <thread>
 
+#include "common/error-text.h"
+#include "common/file-op.h"
 #include "common/log.h"
 #include "common/no-throw.h"
 #include "common/paths.h"
 #include "common/unique-fd.h"
 #include "common/utility.h"
+#include "common/velt-sdk-wrapper.h"
+#include "ipc/daemon-ipc.h"
+#include "ipc/pobject.h"
+#include "service/global-setting.h"
+#include "service/repo-volume.h"
+#include "service/schedule.h"
+#include "updater/updater-core.h"
 
 namespace {
 
@@ -104,9 +118,6 @@ bool StatusFileIsPlain(const std::string& file) {
 void SetServiceStatusLockWait(std::chrono::milliseconds wait) {
   gStatusLockWaitMs.store(wait.count() > 0 ? wait.count() : kStatusLockWait.count());
 }
-
-ServiceStatus::ServiceStatus() : state(PLOVO_SERVICE_STATUS_UNKNOWN) {}
-ServiceStatus::~ServiceStatus() = default;
 
 namespace {
 
@@ -202,3 +213,269 @@ int StatusService() {
   if (pid < 1) return 3;
   return VLIBCProcAlive(pid) ? 0 : 1;
 }
+
+namespace {
+
+constexpr unsigned int kEventServiceStarted = 0x11B01050;
+constexpr unsigned int kEventServiceStopped = 0x11B01051;
+
+// A daemon that has not gone this long after SIGTERM is killed. It is
+// probed often, so that one which exits at once is seen gone at once.
+constexpr std::chrono::milliseconds kStopWait = std::chrono::seconds(10);
+constexpr std::chrono::milliseconds kStopProbe{100};
+std::atomic<std::chrono::milliseconds::rep> gStopWaitMs{kStopWait.count()};
+
+// The volumes the platform knows, freed with the object.
+class VolumeList {
+ public:
+  VolumeList() {
+    if (VELTMountVolAllEnum(&head_) < 0) {
+      PLOVO_LOG(LOG_ERR, "VELTMountVolAllEnum() failed[0x%04X %s:%d]",
+                static_cast<unsigned>(VLIBCErrGet()), VLIBCErrorGetFile(), VLIBCErrorGetLine());
+      head_ = nullptr;
+    }
+  }
+  ~VolumeList() { VELTMountVolInfoFree(head_); }
+  VolumeList(const VolumeList&) = delete;
+  VolumeList& operator=(const VolumeList&) = delete;
+
+  PVELTMOUNTVOLINFO head() const { return head_; }
+
+ private:
+  PVELTMOUNTVOLINFO head_ = nullptr;
+};
+
+// The base path the package uses on a volume. A path that would not read
+// back whole from setting.conf is no use as the repository's.
+bool BasePath(const char* volume, std::string& base) {
+  if (SDK::PathGetShareBin(volume, base) != 0) return false;
+  if (base.size() > Plovo::GlobalSetting::kMaxRepoVolumePath) {
+    PLOVO_LOG(LOG_ERR, "volume path too long [%s]", base.c_str());
+    return false;
+  }
+  return true;
+}
+
+// The mounted volume whose base path already holds a repository, in the
+// platform's order; "" when none does.
+std::string FindExistingRepo() {
+  VolumeList volumes;
+  for (PVELTMOUNTVOLINFO v = volumes.head(); v; v = v->pNext) {
+    std::string base;
+    if (v->isMounted != 1 || !BasePath(v->szPath, base)) continue;
+    if (IsFileExist(base + "/@Plovo")) return base;
+  }
+  return "";
+}
+
+// The first mounted, writable, internal volume's base path; "" when none.
+std::string ChooseRepoVolume() {
+  VolumeList volumes;
+  for (PVELTMOUNTVOLINFO v = volumes.head(); v; v = v->pNext) {
+    if (v->isMounted != 1 || v->isWritable != 1) {
+      PLOVO_LOG(LOG_ERR, "volume not mounted or writable");
+      continue;
+    }
+    if (v->location != VELT_VOL_LOCATION_INTERNAL) {
+      PLOVO_LOG(LOG_ERR, "volume not internal (%d)", v->location);
+      continue;
+    }
+    std::string base;
+    if (BasePath(v->szPath, base)) return base;
+  }
+  return "";
+}
+
+bool WriteState(int state) {
+  ServiceStatus status;
+  status.state = state;
+  return SetServiceStatus(status) == 0;
+}
+
+// Settles which volume holds the repository before anything is prepared
+// on it. 1: repo is usable; 0: no volume can hold one (state 1 written,
+// the start ends there with result); -1: the start fails.
+int SettleRepoVolume(std::string& repo, int& result) {
+  if (repo.empty()) {
+    const std::string existing = FindExistingRepo();
+    if (!existing.empty()) {
+      if (SetRepoVolumePath(existing)) {
+        PLOVO_LOG(LOG_INFO, "Success to reuse repo path [%s].", existing.c_str());
+      } else {
+        PLOVO_LOG(LOG_ERR, "Failed to reuse repo path [%s].", existing.c_str());
+      }
+      repo = existing;
+    }
+  }
+  if (IsRepoValid(repo)) return 1;
+
+  const std::string chosen = ChooseRepoVolume();
+  if (chosen.empty()) {
+    if (!WriteState(PLOVO_SERVICE_STATUS_NO_REPO)) {
+      PLOVO_LOG(LOG_ERR, "fail to SetServiceStatus()");
+      result = -1;
+      return 0;
+    }
+    result = SetRepoVolumePath("") ? 0 : -1;
+    return 0;
+  }
+  if (!repo.empty()) {
+    if (!move_repo_volume(repo, chosen)) return -1;
+    PLOVO_LOG(LOG_ERR, "Repo volume [%s] was not valid, create new repo volume as [%s].",
+              repo.c_str(), chosen.c_str());
+    if (MakeRepo(chosen) != 0) return -1;
+  } else {
+    if (MakeRepo(chosen) != 0) return -1;
+    PLOVO_LOG(LOG_ERR, "Repo volume was empty, create default repo volume as [%s].",
+              chosen.c_str());
+  }
+  repo = chosen;
+  return SetRepoVolumePath(repo) ? 1 : -1;
+}
+
+// Prepares the repository on repo and starts the daemon. 0 when the
+// daemon started; -1 on failure, with status.error set when the failure
+// has a tag of its own.
+int PrepareAndRun(const std::string& repo, UpdaterCore& updater, ServiceStatus& status) {
+  if (!WriteState(PLOVO_SERVICE_STATUS_INIT)) {
+    PLOVO_LOG(LOG_ERR, "fail to update plovo status to init.");
+    return -1;
+  }
+  if (!init_global_setting()) return -1;
+  if (MakeRepo(repo) != 0) {
+    PLOVO_LOG(LOG_ERR, "Failed to MakeRepo '%s'", repo.c_str());
+    PLOVO_LOG(LOG_ERR, "fail to prepare env.");
+    return -1;
+  }
+  if (!WriteState(PLOVO_SERVICE_STATUS_UPGRADING)) {
+    PLOVO_LOG(LOG_ERR, "fail to update plovo status to upgrading.");
+    return -1;
+  }
+  if (updater.Update(repo + "/@Plovo") != 0) {
+    status.error = "err_upgrade_failed";
+    PLOVO_LOG(LOG_ERR, "fail to run updater");
+    return -1;
+  }
+  if (!Plovo::ShowAllSchedule()) {
+    PLOVO_LOG(LOG_ERR, "fail to ShowAllSchedule");
+    return -1;
+  }
+  // The daemon puts itself in the background; the state "running" is its
+  // own to write once it serves.
+  if (VLIBCExec(Plovo::Path::DaemonProgram().c_str(), nullptr, nullptr, nullptr, nullptr) < 0) {
+    PLOVO_LOG(LOG_ERR, "Failed to start daemon\n");
+    status.error = "err_sys";
+    PLOVO_LOG(LOG_ERR, "fail to run daemon");
+    return -1;
+  }
+  VELTLogSet1(VELT_LOG_CATEGORY_SYSTEM, VELT_LOG_LEVEL_INFO, kEventServiceStarted, "Plovo", "", "",
+              "");
+  return 0;
+}
+
+int Start() {
+  ServiceStatus status;
+  UpdaterCore updater;
+  if (!IsPkgEnable()) return 0;
+
+  std::string repo = Plovo::GlobalSetting::GetRepoVolumePath();
+  int result = 0;
+  const int settled = SettleRepoVolume(repo, result);
+  if (settled == 0) return result;
+  if (settled > 0 && PrepareAndRun(repo, updater, status) == 0) return 0;
+
+  status.state = PLOVO_SERVICE_STATUS_ERROR;
+  if (status.error.empty()) status.error = "err_sys";
+  if (SetServiceStatus(status) != 0) PLOVO_LOG(LOG_ERR, "fail to update plovo status to error.");
+  return -1;
+}
+
+// Whether the process pid has ended. One that has exited but is not yet
+// collected by its parent (init, for a daemon) still answers signal 0,
+// for as long as the parent takes; it is gone all the same.
+bool ProcessGone(int pid) {
+  if (kill(pid, 0) != 0) return errno == ESRCH;
+  char path[32];
+  std::snprintf(path, sizeof path, "/proc/%d/stat", pid);
+  FILE* file = std::fopen(path, "re");
+  if (!file) return errno == ENOENT;
+  char line[512] = {};
+  const size_t n = std::fread(line, 1, sizeof line - 1, file);
+  std::fclose(file);
+  // "<pid> (<name>) <state> ...": the name may hold ") " itself.
+  const char* close = std::strrchr(line, ')');
+  return n > 0 && close && (close[1] == ' ') && (close[2] == 'Z' || close[2] == 'X');
+}
+
+// Ends the daemon of pid, which has been asked to stop: SIGTERM, then
+// SIGKILL when it outlives the wait. 0 when it is gone or killed.
+int EndDaemon(int pid) {
+  if (kill(pid, SIGTERM) != 0) {
+    if (errno == ESRCH) {
+      PLOVO_LOG(LOG_INFO, "pid does not exist\n");
+      unlink(Plovo::Path::DaemonPidFile().c_str());
+      return 0;
+    }
+    const int err = errno;
+    PLOVO_LOG(LOG_ERR, "Kill daemon: %s (%d)\n", Plovo::ErrorText(err).c_str(), err);
+    return -1;
+  }
+  const auto deadline =
+      std::chrono::steady_clock::now() + std::chrono::milliseconds(gStopWaitMs.load());
+  for (;;) {
+    if (ProcessGone(pid)) {
+      PLOVO_LOG(LOG_INFO, "daemon is dead\n");
+      return 0;
+    }
+    if (std::chrono::steady_clock::now() >= deadline) break;
+    std::this_thread::sleep_for(kStopProbe);
+  }
+  kill(pid, SIGKILL);
+  PLOVO_LOG(LOG_WARNING, "forcelly kill daemon\n");
+  return 0;
+}
+
+int Stop() {
+  const std::string pidFile = Plovo::Path::DaemonPidFile();
+  // Read before the stop command: a daemon that obeys it removes its pid
+  // file on the way out, and the process would then be lost from sight
+  // while it may still be finishing.
+  const int pid = VLIBCReadPidFile(pidFile.c_str());
+
+  PObject command;
+  command["action"] = "stop";
+  command["need_ack"] = 0;
+  PObject reply;
+  if (DaemonIPC().SendCommand(command, reply) < 0) {
+    PLOVO_LOG(LOG_ERR, "StopDaemon: Plovo failed to stop daemon, try to kill it.\n");
+  }
+
+  int result = -1;
+  if (pid < 1) {
+    PLOVO_LOG(LOG_ERR, "Failed to read '%s'\n", pidFile.c_str());
+  } else {
+    result = EndDaemon(pid);
+  }
+  if (result != 0) {
+    PLOVO_LOG(LOG_ERR, "Failed to kill daemon\n");
+    return -1;
+  }
+
+  if (!Plovo::HideAllSchedule()) PLOVO_LOG(LOG_ERR, "fail to HideAllSchedule");
+  if (!WriteState(PLOVO_SERVICE_STATUS_STOP)) {
+    PLOVO_LOG(LOG_ERR, "fail to update plovo status to stop.");
+  }
+  VELTLogSet1(VELT_LOG_CATEGORY_SYSTEM, VELT_LOG_LEVEL_INFO, kEventServiceStopped, "Plovo", "", "",
+              "");
+  return 0;
+}
+
+}  // namespace
+
+void SetStopServiceWait(std::chrono::milliseconds wait) {
+  gStopWaitMs.store(wait.count() > 0 ? wait.count() : kStopWait.count());
+}
+
+int StartService(void) { return Plovo::NoThrow(Start, -1); }
+
+int StopService(void) { return Plovo::NoThrow(Stop, -1); }

@@ -23,6 +23,8 @@
 #include <sstream>
 #include <string>
 
+#include "module-path.h"
+
 namespace {
 
 constexpr const char* kApiName = "VELT.Plovo";
@@ -37,16 +39,6 @@ int Usage(const std::string& why) {
   std::cerr << "plovo-api: " << why << "\n"
             << "usage: plovo-api [--debug] [--module PATH] METHOD [PARAMS_JSON]\n";
   return 2;
-}
-
-// The module installed beside this program: <bin>/../lib/libplovo-webapi.so.
-std::string DefaultModulePath() {
-  char self[4096];
-  ssize_t n = readlink("/proc/self/exe", self, sizeof(self) - 1);
-  if (n <= 0) return "libplovo-webapi.so";
-  std::string dir(self, static_cast<size_t>(n));
-  dir.erase(dir.rfind('/'));
-  return dir + "/../lib/libplovo-webapi.so";
 }
 
 // Parses the PARAMS_JSON argument; false, with the reason in *why, when it

@@ -1,17 +1,23 @@
 // plovod-dev: a development stand-in for the copy daemon.
 //
-//   plovod-dev
+//   plovod-dev [--foreground]
 //
 // Listens on the daemon socket ($PLOVO_ROOT/tmp/plovo-socket in a sandbox)
 // and answers the task commands the web-API module sends, so that plovo-api
 // can list, create, edit, run and delete tasks on a machine without the
-// real daemon. It is not the real daemon: no file is ever copied, "running"
+// real daemon. Started without arguments, as the service start runs the
+// package's daemon program, it puts itself in the background and its
+// command returns once it serves; --foreground keeps it in the terminal.
+// Either way it holds the pid file "/var/run/plovod.pid" under a lock (a
+// second one refuses to start), writes the running state (4) when it
+// serves, and removes its socket and pid file when it ends. It is not the real daemon: no file is ever copied, "running"
 // is only a status, and tasks live in memory, so every start begins with
 // none. Every task reports schedule_id -1: schedules are not kept yet.
 //
 // One connection carries one command; connections are served on several
 // threads, the commands one at a time. Each request gives one line on
-// stderr ("list_task -> ok", "run_task 3 -> error 3"). SIGINT, SIGTERM or a
+// stderr ("list_task -> ok", "run_task 3 -> error 3"); in the background
+// stderr is /dev/null. SIGINT, SIGTERM or a
 // "stop" request (which gets no answer) end it; the socket file is removed
 // on the way out.
 //
@@ -20,11 +26,16 @@
 //   3  conflict: the task name is taken, or the task is already running
 //   4  no such task
 //   8  cancel of a task that is not running (the module counts it a success)
+#include <fcntl.h>
 #include <signal.h>
+#include <sys/file.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdint>
 #include <cstdio>
+#include <cstdlib>
+#include <cstring>
 #include <functional>
 #include <map>
 #include <mutex>
@@ -34,6 +45,7 @@
 #include "common/log.h"
 #include "common/paths.h"
 #include "ipc/command-server.h"
+#include "service/service-ctrl.h"
 
 namespace {
 
@@ -298,11 +310,73 @@ Outcome DevDaemon::GetFilter(const Task& task) const {
 
 }  // namespace
 
-int main(int argc, char**) {
-  if (argc != 1) {
-    std::fprintf(stderr, "usage: plovod-dev\n");
+// Takes the pid file under an exclusive lock held for the process's life
+// and writes this process's id into it. False when another instance holds
+// it or it cannot be written.
+bool TakePidFile(const std::string& path) {
+  const int fd = open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+  if (fd < 0) {
+    std::fprintf(stderr, "plovod-dev: cannot open %s: %s\n", path.c_str(), std::strerror(errno));
+    return false;
+  }
+  if (flock(fd, LOCK_EX | LOCK_NB) != 0) {
+    std::fprintf(stderr, "plovod-dev: another one runs (%s is locked)\n", path.c_str());
+    close(fd);
+    return false;
+  }
+  const std::string pid = std::to_string(getpid()) + "\n";
+  if (ftruncate(fd, 0) != 0 || write(fd, pid.data(), pid.size()) != static_cast<ssize_t>(pid.size())) {
+    std::fprintf(stderr, "plovod-dev: cannot write %s\n", path.c_str());
+    close(fd);
+    return false;
+  }
+  return true;  // fd stays open: the lock lasts until the process ends
+}
+
+// Puts the process in the background: the parent returns from here only
+// to exit, with 0 once the child reported that it serves (a byte on
+// *ready) and 1 when the child gave up first.
+void Daemonize(int* ready) {
+  int report[2];
+  if (pipe2(report, O_CLOEXEC) != 0) {
+    std::perror("plovod-dev: pipe");
+    std::exit(1);
+  }
+  const pid_t child = fork();
+  if (child < 0) {
+    std::perror("plovod-dev: fork");
+    std::exit(1);
+  }
+  if (child > 0) {
+    close(report[1]);
+    char byte = 0;
+    ssize_t n;
+    do n = read(report[0], &byte, 1);
+    while (n < 0 && errno == EINTR);
+    std::_Exit(n == 1 ? 0 : 1);
+  }
+  close(report[0]);
+  setsid();
+  // Nobody reads the terminal of a background process, and an inherited
+  // pipe would keep whoever started it waiting for the end of its output.
+  const int null = open("/dev/null", O_RDWR);
+  if (null >= 0) {
+    dup2(null, STDIN_FILENO);
+    dup2(null, STDOUT_FILENO);
+    dup2(null, STDERR_FILENO);
+    if (null > STDERR_FILENO) close(null);
+  }
+  *ready = report[1];
+}
+
+int main(int argc, char** argv) {
+  const bool foreground = argc == 2 && std::strcmp(argv[1], "--foreground") == 0;
+  if (argc != 1 && !foreground) {
+    std::fprintf(stderr, "usage: plovod-dev [--foreground]\n");
     return 2;
   }
+  int ready = -1;
+  if (!foreground) Daemonize(&ready);
   // The library's own complaints (a socket that cannot be bound, a broken
   // stream) belong with this program's lines, not in the system log.
   Plovo::SetLogSink([](int priority, const std::string& line) {
@@ -322,17 +396,34 @@ int main(int argc, char**) {
   CommandServer server(daemon.Commands(), daemon.Unknown(), [](const std::string& problem) {
     std::fprintf(stderr, "plovod-dev: %s\n", problem.c_str());
   });
+  const std::string pidFile = Plovo::Path::DaemonPidFile();
+  if (!TakePidFile(pidFile)) return 1;
   const std::string path = Plovo::Path::DaemonSocket();
   if (server.Start(path) != 0) {  // replaces a stale socket file
     std::fprintf(stderr, "plovod-dev: cannot listen on %s (does its folder exist?)\n",
                  path.c_str());
+    unlink(pidFile.c_str());
+    return 1;
+  }
+  ServiceStatus running;
+  running.state = PLOVO_SERVICE_STATUS_RUNNING;
+  if (SetServiceStatus(running) != 0) {
+    std::fprintf(stderr, "plovod-dev: cannot write the running state\n");
+    server.Stop();
+    unlink(pidFile.c_str());
     return 1;
   }
   std::fprintf(stderr, "plovod-dev: listening on %s\n", path.c_str());
+  if (ready >= 0) {
+    const char byte = 1;
+    if (write(ready, &byte, 1) != 1) std::fprintf(stderr, "plovod-dev: cannot report readiness\n");
+    close(ready);
+  }
 
   int received = 0;
   sigwait(&ends, &received);
   server.Stop();
+  unlink(pidFile.c_str());
   std::fprintf(stderr, "plovod-dev: stopped\n");
   return 0;
 }

@@ -48,6 +48,10 @@ int GetDevPath(const std::string& path, std::string& devPath);
 // cleared when it has neither.
 int GetUUID(const std::string& path, const std::string& devPath, std::string& uuid);
 
+// The base path the package uses on the volume volPath, as the platform
+// gives it (its 256-byte answer). 0, or -1 with path cleared.
+int PathGetShareBin(const std::string& volPath, std::string& path);
+
 // A new random identity in the 36-character text form, lower case.
 std::string GenerateUUID();
 

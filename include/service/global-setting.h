@@ -11,6 +11,9 @@ namespace Plovo {
 
 class GlobalSetting {
  public:
+  // The longest repository volume path that reads back whole.
+  static constexpr size_t kMaxRepoVolumePath = 63;
+
   // The repository's volume path (at most 63 bytes; a longer value is cut),
   // or "" when it cannot be read.
   static std::string GetRepoVolumePath();

@@ -29,9 +29,11 @@ enum PLOVO_SERVICE_STATUS {
 // The pair kept in the status file. `state` holds a PLOVO_SERVICE_STATUS
 // value, or whatever number the file holds; `error` is a tag such as
 // "err_sys" or "err_upgrade_failed", empty when there is none.
+// Defined here so that a program which loads the module can make one to
+// pass to the exported GetServiceStatus.
 struct ServiceStatus {
-  ServiceStatus();
-  ~ServiceStatus();
+  ServiceStatus() : state(PLOVO_SERVICE_STATUS_UNKNOWN) {}
+  ~ServiceStatus() = default;
 
   int state;
   std::string error;
@@ -65,5 +67,29 @@ bool IsRepoValid(const std::string& volumePath);
 // The daemon's liveness from "/var/run/plovod.pid": 0 alive, 1 pid file
 // present but the process gone, 3 no usable pid file.
 int StatusService();
+
+// Brings the enabled package to a running daemon: settles the repository
+// volume (the recorded one, else an existing "@Plovo" on a mounted volume,
+// else the first mounted, writable, internal volume), creates the
+// repository, runs the installer and migrations, shows the scheduler
+// entries and starts the daemon program, which writes the running state
+// itself. States written on the way: 2, 3; 1 when no volume can hold the
+// repository (the daemon is then not started); 7 with "err_upgrade_failed"
+// or "err_sys" on a failure. 0 on success, when the package is disabled
+// (nothing is done) and in state 1; -1 on failure. Blocks while the
+// installer and the daemon's start run.
+PLOVO_EXPORT int StartService(void);
+
+// Stops the daemon: the "stop" command, then SIGTERM to the process of the
+// pid file, waiting up to ten seconds (probing every 100 ms) before
+// SIGKILL; then hides the scheduler entries and writes state 6. A pid file
+// whose process is gone is removed and counts as stopped. 0, or -1 when
+// there is no pid file or the signal cannot be sent (the state is then left
+// alone).
+PLOVO_EXPORT int StopService(void);
+
+// Replaces the ten seconds StopService waits for the daemon to go before
+// it kills it; zero or less restores them. For tests.
+void SetStopServiceWait(std::chrono::milliseconds wait);
 
 #endif

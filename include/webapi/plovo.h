@@ -149,10 +149,6 @@ class PlovoHandle {
   // entry that cannot be loaded, or a disabled one.
   static std::string GetNextRunTime(int64_t scheduleId);
 
-  // Answer of a method whose action has not been built yet: 401, and a log
-  // line naming the action.
-  void NotAvailableYet(const char* action);
-
   VELT::APIRequest* request;
   VELT::APIResponse* response;
 };

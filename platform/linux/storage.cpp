@@ -166,6 +166,18 @@ int VELTDevPathGet(const char* path, char* devPath, size_t size) {
   return CopyOut(holder->devPath, devPath, size) ? 0 : -1;
 }
 
+// A development host has no per-volume place of its own for package data:
+// the volume path itself is the base.
+int VELTShareBinPathGet(const char* volPath, char* binPath, size_t size) {
+  if (binPath && size > 0) binPath[0] = '\0';
+  if (VELT_FAULT_HIT()) return -1;
+  if (!volPath || volPath[0] == '\0' || !binPath || size == 0) {
+    VELT_FAIL(VLIBC_ERR_BAD_PARAMETER);
+    return -1;
+  }
+  return CopyOut(volPath, binPath, size) ? 0 : -1;
+}
+
 int VELTDevFsUuidGet(const char* devPath, char* uuid, size_t size) {
   if (uuid && size > 0) uuid[0] = '\0';
   if (VELT_FAULT_HIT()) return -1;

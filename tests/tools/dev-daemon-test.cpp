@@ -31,10 +31,11 @@ class DevDaemonTest : public plovo_test::SandboxTest {
   // (a plain file at that path does not count).
   void Start() {
     MakeDir("/tmp");
+    MakeDir("/var/run");
     pid_ = fork();
     if (pid_ == 0) {
       dup2(open(Path("/daemon.log").c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644), 2);
-      execl(PLOVOD_DEV_PATH, PLOVOD_DEV_PATH, static_cast<char*>(nullptr));
+      execl(PLOVOD_DEV_PATH, PLOVOD_DEV_PATH, "--foreground", static_cast<char*>(nullptr));
       _exit(127);
     }
     struct stat st {};

@@ -53,8 +53,8 @@ TEST_F(DispatchTest, EachListedMethodReachesItsOwnAction) {
       {"cancel", "cancel_task"},
       {"enable", "enable_task"},
       {"disable", "disable_task"},
-      {"get_global_setting", "Action GetGlobalSetting is not available yet"},
-      {"set_global_setting", "Action SetGlobalSetting is not available yet"},
+      {"get_global_setting", "No repo volume path"},
+      {"set_global_setting", "Invalid parameter"},
       {"get_log_list", "Failed to get limit"}};
   for (const auto& [method, evidence] : rows) {
     LogCapture log;

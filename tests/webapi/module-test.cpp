@@ -70,7 +70,9 @@ TEST_F(ModuleTest, TableListsFifteenMethodsServedByItsOwnProcess) {
 TEST(ModuleExportsTest, OnlyTheEntryPointsAreExported) {
   CommandResult nm = RunCommand(std::string("nm -D --defined-only -j ") + PLOVO_MODULE_PATH);
   ASSERT_EQ(nm.status, 0) << nm.out;
-  EXPECT_EQ(nm.out, "GetAPITable\nGetServiceStatus\nProcess\nSetServiceStatus\n");
+  EXPECT_EQ(nm.out,
+            "ChangeRepoVolume\nCollectUageStatistics\nGetAPITable\nGetServiceStatus\nProcess\n"
+            "SetServiceStatus\nStartService\nStopService\n");
 }
 
 class PlovoApiTest : public plovo_test::SandboxTest {

@@ -24,11 +24,11 @@ class WebApiTest : public SandboxTest {
   }
   // Whether a request without parameters, with no daemon listening, got
   // past the gate to its action: the task actions refuse the missing
-  // parameters (402), "list" fails to reach the daemon, and the actions not
-  // built yet say so.
+  // parameters (402), "list" fails to reach the daemon, and
+  // "get_global_setting" finds no repository volume.
   static bool ReachedAction(const VELT::APIResponse& response, const LogCapture& log) {
     return response.GetErrorCode() == 402 || log.Contains("Failed to send List command") ||
-           log.Contains("is not available yet");
+           log.Contains("No repo volume path");
   }
 };
 

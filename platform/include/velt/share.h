@@ -40,6 +40,12 @@ VELT_API int VELTDevPathGet(const char* path, char* devPath, size_t size);
  * cannot be read, VLIBC_ERR_BAD_PARAMETER when the identity does not fit. */
 VELT_API int VELTDevFsUuidGet(const char* devPath, char* uuid, size_t size);
 
+/* Writes into binPath (size bytes) the base path under which a package
+ * keeps its own folders on the volume volPath (a path such as /volume1).
+ * Returns 0; negative with VLIBC_ERR_BAD_PARAMETER for a null or empty
+ * volume path or a result that does not fit. */
+VELT_API int VELTShareBinPathGet(const char* volPath, char* binPath, size_t size);
+
 #ifdef __cplusplus
 }
 #endif
