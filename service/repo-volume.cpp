@@ -55,10 +55,13 @@ bool MoveRepo(const std::string& from, const std::string& to) {
     PLOVO_LOG(LOG_ERR, "FAIL: %s already exists", dst.c_str());
     return false;
   }
-  // A volume need not have its temporary folder yet.
-  if (FSMKDir(to + "/@tmp", false, kUnchangedId, kUnchangedId) != 0) {
-    PLOVO_LOG(LOG_ERR, "FAIL: mkdir %s", (to + "/@tmp").c_str());
-    return false;
+  // A volume need not have its temporary folder yet; the old repository
+  // is retired through its own volume's, so both must be there.
+  for (const std::string& tmp : {to + "/@tmp", from + "/@tmp"}) {
+    if (FSMKDir(tmp, false, kUnchangedId, kUnchangedId) != 0) {
+      PLOVO_LOG(LOG_ERR, "FAIL: mkdir %s", tmp.c_str());
+      return false;
+    }
   }
   // Whatever an earlier attempt left in the staging place is a copy, never
   // the repository; cp onto it would nest the new copy inside the old one.

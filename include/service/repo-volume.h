@@ -34,10 +34,11 @@ int MakeRepo(const std::string& volumePath);
 bool SetRepoVolumePath(const std::string& volumePath);
 
 // Moves from + "/@Plovo" to to + "/@Plovo" through to + "/@tmp/@Plovo",
-// creating to + "/@tmp" when the volume has none. False when the copy or
-// the rename into place fails; the old repository is then whole and in its
-// place. Refuses (false, nothing copied) when to + "/@Plovo" already exists,
-// since renaming onto it would bury the copy inside it.
+// creating the "@tmp" folder of either volume when it has none. False when
+// the copy or the rename into place fails; the old repository is then
+// whole and in its place. Refuses (false, nothing copied) when
+// to + "/@Plovo" already exists, since renaming onto it would bury the copy
+// inside it.
 bool move_repo_volume(const std::string& from, const std::string& to);
 
 // Moves the repository from the volume `from` (empty: there is none yet,
