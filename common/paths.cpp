@@ -16,6 +16,7 @@ std::string Rooted(const std::string& systemPath) { return Root() + systemPath; 
 std::string PackageDir() { return Rooted("/var/packages/Plovo"); }
 std::string StatusFile() { return Rooted("/var/packages/Plovo/etc/status"); }
 std::string StatusLockFile() { return Rooted("/var/packages/Plovo/etc/status.lock"); }
+std::string ServiceLockFile() { return Rooted("/var/packages/Plovo/etc/service.lock"); }
 std::string SettingFile() { return Rooted("/var/packages/Plovo/etc/setting.conf"); }
 std::string RegVolumeFile() { return Rooted("/var/packages/Plovo/etc/veltpkg_conf/reg_volume"); }
 std::string EnabledFile() { return Rooted("/var/packages/Plovo/enabled"); }

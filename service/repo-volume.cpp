@@ -11,6 +11,7 @@
 #include "common/log.h"
 #include "common/no-throw.h"
 #include "common/paths.h"
+#include "service/global-setting.h"
 #include "service/service-ctrl.h"
 
 namespace {
@@ -36,16 +37,27 @@ bool ReplaceFile(const std::string& file, const std::string& text) {
   return true;
 }
 
-// Starts "rm -rf path" without waiting for it.
+// Starts "rm -rf path" without waiting for it: deleting a large tree must
+// not hold up the service's start.
 void RemoveInBackground(const std::string& path) {
   if (VLIBCBackgroundExec("/bin/rm", "-rf", path.c_str(), nullptr, nullptr) < 0) {
     PLOVO_LOG(LOG_ERR, "FAIL: rm -rf %s", path.c_str());
   }
 }
 
+// Runs "rm -rf path" and waits for it. A staging place is cleared this way
+// before use: cp or mv onto a folder left there would put the new tree
+// inside the old one, and a symbolic link is removed, not followed.
+bool RemoveNow(const std::string& path) {
+  if (VLIBCExec("/bin/rm", "-rf", path.c_str(), nullptr, nullptr) < 0) {
+    PLOVO_LOG(LOG_ERR, "FAIL: rm -rf %s", path.c_str());
+    return false;
+  }
+  return true;
+}
+
 bool MoveRepo(const std::string& from, const std::string& to) {
   const std::string src = from + "/@Plovo";
-  const std::string srcTmp = from + "/@tmp" + "/@Plovo";
   const std::string dst = to + "/@Plovo";
   const std::string dstTmp = to + "/@tmp" + "/@Plovo";
 
@@ -55,21 +67,12 @@ bool MoveRepo(const std::string& from, const std::string& to) {
     PLOVO_LOG(LOG_ERR, "FAIL: %s already exists", dst.c_str());
     return false;
   }
-  // A volume need not have its temporary folder yet; the old repository
-  // is retired through its own volume's, so both must be there.
-  for (const std::string& tmp : {to + "/@tmp", from + "/@tmp"}) {
-    if (FSMKDir(tmp, false, kUnchangedId, kUnchangedId) != 0) {
-      PLOVO_LOG(LOG_ERR, "FAIL: mkdir %s", tmp.c_str());
-      return false;
-    }
-  }
-  // Whatever an earlier attempt left in the staging place is a copy, never
-  // the repository; cp onto it would nest the new copy inside the old one.
-  if (IsFileExist(dstTmp) && VLIBCExec("/bin/rm", "-rf", dstTmp.c_str(), nullptr, nullptr) < 0) {
-    PLOVO_LOG(LOG_ERR, "FAIL: rm -rf %s", dstTmp.c_str());
+  // A volume need not have its temporary folder yet.
+  if (FSMKDir(to + "/@tmp", false, kUnchangedId, kUnchangedId) != 0) {
+    PLOVO_LOG(LOG_ERR, "FAIL: mkdir %s", (to + "/@tmp").c_str());
     return false;
   }
-
+  if (!RemoveNow(dstTmp)) return false;
   if (VLIBCExec("/bin/cp", "-rf", src.c_str(), dstTmp.c_str(), nullptr) < 0) {
     PLOVO_LOG(LOG_ERR, "FAIL: cp -rf %s %s", src.c_str(), dstTmp.c_str());
     RemoveInBackground(dstTmp);
@@ -79,14 +82,31 @@ bool MoveRepo(const std::string& from, const std::string& to) {
     PLOVO_LOG(LOG_ERR, "FAIL: mv %s %s", dstTmp.c_str(), dst.c_str());
     return false;
   }
+  return true;
+}
+
+}  // namespace
+
+void RetireRepo(const std::string& from) {
+  const std::string src = from + "/@Plovo";
+  const std::string srcTmp = from + "/@tmp" + "/@Plovo";
+  // Without its temporary folder (a volume gone read-only, say) the old
+  // repository cannot be moved aside; the rename below then fails, which
+  // is logged, and the copy in use is unaffected.
+  if (FSMKDir(from + "/@tmp", false, kUnchangedId, kUnchangedId) != 0) {
+    PLOVO_LOG(LOG_ERR, "FAIL: mkdir %s", (from + "/@tmp").c_str());
+  } else {
+    RemoveNow(srcTmp);
+  }
   if (VLIBCExec("/bin/mv", src.c_str(), srcTmp.c_str(), nullptr, nullptr) < 0) {
     PLOVO_LOG(LOG_ERR, "FAIL: mv %s %s", src.c_str(), srcTmp.c_str());
   }
   RemoveInBackground(srcTmp);
-  return true;
 }
 
-// Marks a failed change: state 7 with the tag the start leaves, or none.
+namespace {
+
+// Marks a failed change: state 7, with an empty tag.
 bool FailChange() {
   ServiceStatus status;
   status.state = PLOVO_SERVICE_STATUS_ERROR;
@@ -100,6 +120,17 @@ bool ChangeRepo(const std::string& from, const std::string& to) {
     return false;
   }
   if (from == to) return true;
+
+  ServiceLock lock;
+  if (!lock.locked()) return false;
+  // Another request may have moved the repository while this one waited:
+  // its "from" would then name a volume that holds none any more.
+  const std::string recorded = Plovo::GlobalSetting::GetRepoVolumePath();
+  if (recorded == to) return true;
+  if (recorded != from) {
+    PLOVO_LOG(LOG_ERR, "repo volume is [%s] now, not [%s]", recorded.c_str(), from.c_str());
+    return false;
+  }
 
   if (StatusService() == 0 && StopService() != 0) {
     PLOVO_LOG(LOG_ERR, "failed to StopService()");
@@ -129,7 +160,10 @@ bool ChangeRepo(const std::string& from, const std::string& to) {
     return false;
   }
 
+  // The old repository goes only once the new one is recorded: until then
+  // it is the one the record names.
   if (!SetRepoVolumePath(to)) return FailChange();
+  if (!from.empty()) RetireRepo(from);
   if (StartService() != 0) {
     PLOVO_LOG(LOG_ERR, "failed to StartService()");
     return FailChange();

@@ -225,6 +225,11 @@ constexpr std::chrono::milliseconds kStopWait = std::chrono::seconds(10);
 constexpr std::chrono::milliseconds kStopProbe{100};
 std::atomic<std::chrono::milliseconds::rep> gStopWaitMs{kStopWait.count()};
 
+// How many ServiceLock objects the thread holds; only the outermost takes
+// and releases the flock, which a second open of the file in the same
+// process would wait for forever.
+thread_local int tServiceLockDepth = 0;
+
 // The volumes the platform knows, freed with the object.
 class VolumeList {
  public:
@@ -329,8 +334,11 @@ int SettleRepoVolume(std::string& repo, int& result) {
     PLOVO_LOG(LOG_ERR, "Repo volume was empty, create default repo volume as [%s].",
               chosen.c_str());
   }
+  if (!SetRepoVolumePath(chosen)) return -1;
+  // The old repository goes only once the new volume is recorded.
+  if (!repo.empty()) RetireRepo(repo);
   repo = chosen;
-  return SetRepoVolumePath(repo) ? 1 : -1;
+  return 1;
 }
 
 // Prepares the repository on repo and starts the daemon. 0 when the
@@ -377,6 +385,14 @@ int Start() {
   ServiceStatus status;
   UpdaterCore updater;
   if (!IsPkgEnable()) return 0;
+  ServiceLock lock;
+  if (!lock.locked()) return -1;
+  // A second daemon would refuse to start, and the installer would run
+  // under the first one's feet.
+  if (StatusService() == 0) {
+    PLOVO_LOG(LOG_INFO, "daemon is already running");
+    return 0;
+  }
 
   std::string repo = Plovo::GlobalSetting::GetRepoVolumePath();
   int result = 0;
@@ -432,15 +448,35 @@ int EndDaemon(int pid) {
   }
   kill(pid, SIGKILL);
   PLOVO_LOG(LOG_WARNING, "forcelly kill daemon\n");
+  // Whatever comes next (a repository move) must not find the daemon still
+  // holding its files; SIGKILL takes effect at once, so this is short.
+  for (int i = 0; i < 10 && !ProcessGone(pid); ++i) std::this_thread::sleep_for(kStopProbe);
   return 0;
 }
 
+// Whether some process holds the pid file's lock, as the daemon does for
+// its whole life.
+bool PidFileHeld(const std::string& pidFile) {
+  Plovo::UniqueFd fd(open(pidFile.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
+  if (!fd) return false;
+  if (flock(fd.get(), LOCK_SH | LOCK_NB) == 0) {
+    flock(fd.get(), LOCK_UN);
+    return false;
+  }
+  return errno == EWOULDBLOCK;
+}
+
 int Stop() {
+  ServiceLock lock;
+  if (!lock.locked()) return -1;
   const std::string pidFile = Plovo::Path::DaemonPidFile();
   // Read before the stop command: a daemon that obeys it removes its pid
   // file on the way out, and the process would then be lost from sight
-  // while it may still be finishing.
+  // while it may still be finishing. A pid file that nobody holds is left
+  // over from a daemon that is gone; its number may belong to another
+  // program by now, which must not be signalled.
   const int pid = VLIBCReadPidFile(pidFile.c_str());
+  const bool stale = pid >= 1 && !PidFileHeld(pidFile);
 
   PObject command;
   command["action"] = "stop";
@@ -453,6 +489,10 @@ int Stop() {
   int result = -1;
   if (pid < 1) {
     PLOVO_LOG(LOG_ERR, "Failed to read '%s'\n", pidFile.c_str());
+  } else if (stale) {
+    PLOVO_LOG(LOG_INFO, "pid does not exist\n");
+    unlink(pidFile.c_str());
+    result = 0;
   } else {
     result = EndDaemon(pid);
   }
@@ -471,6 +511,36 @@ int Stop() {
 }
 
 }  // namespace
+
+ServiceLock::ServiceLock() {
+  if (tServiceLockDepth > 0) {
+    ++tServiceLockDepth;
+    locked_ = true;
+    return;
+  }
+  fd_ = open(Plovo::Path::ServiceLockFile().c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
+  if (fd_ < 0) {
+    PLOVO_LOG(LOG_ERR, "Failed to open plovo service lock file.");
+    return;
+  }
+  int locked;
+  do locked = flock(fd_, LOCK_EX);
+  while (locked != 0 && errno == EINTR);
+  if (locked != 0) {
+    PLOVO_LOG(LOG_ERR, "Failed to lock file.");
+    close(fd_);
+    fd_ = -1;
+    return;
+  }
+  ++tServiceLockDepth;
+  locked_ = true;
+}
+
+ServiceLock::~ServiceLock() {
+  if (!locked_) return;
+  --tServiceLockDepth;
+  if (fd_ >= 0) close(fd_);  // releases the flock
+}
 
 void SetStopServiceWait(std::chrono::milliseconds wait) {
   gStopWaitMs.store(wait.count() > 0 ? wait.count() : kStopWait.count());

@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <list>
 
+#include "common/file-op.h"
 #include "common/log.h"
 #include "common/no-throw.h"
 #include "db/task-db.h"
@@ -37,9 +38,11 @@ int Collect() {
   const std::string repo = Plovo::GlobalSetting::GetRepoVolumePath();
   const std::string path = repo + "/@Plovo/db" + "/" + "task-db.sqlite";
   // Without a recorded volume the path would name a folder at the top of
-  // the system, which is no repository.
+  // the system, which is no repository; and a database opened where there
+  // is none would be created, and the next start would take it for an
+  // install that already has its default tasks.
   TaskDB db;
-  if (repo.empty() || db.Initialize(path) != 0) {
+  if (repo.empty() || !IsFileExist(path) || db.Initialize(path) != 0) {
     PLOVO_LOG(LOG_ERR, "Failed to init task db at '%s'\n", path.c_str());
     return -1;
   }

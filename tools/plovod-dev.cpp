@@ -337,6 +337,9 @@ bool TakePidFile(const std::string& path) {
 // to exit, with 0 once the child reported that it serves (a byte on
 // *ready) and 1 when the child gave up first.
 void Daemonize(int* ready) {
+  // Whatever its starter left open (a web server's sockets and pipes)
+  // would stay held for as long as the daemon runs.
+  close_range(STDERR_FILENO + 1, ~0U, 0);
   int report[2];
   if (pipe2(report, O_CLOEXEC) != 0) {
     std::perror("plovod-dev: pipe");

@@ -100,7 +100,10 @@ void PlovoHandle::SetGlobalSetting() {
     response->SetError(402);
     return;
   }
-  const std::string& requested = path.Get();
+  // "/volume2/" names the volume "/volume2": compared as written, it would
+  // look like another volume and set off a move onto itself.
+  std::string requested = path.Get();
+  while (requested.size() > 1 && requested.back() == '/') requested.pop_back();
 
   PLOVO_RUN_AS_ROOT(runAs);
   if (!runAs.ok()) {

@@ -21,6 +21,7 @@ std::string Rooted(const std::string& systemPath);
 std::string PackageDir();       // /var/packages/Plovo
 std::string StatusFile();       // /var/packages/Plovo/etc/status
 std::string StatusLockFile();   // /var/packages/Plovo/etc/status.lock
+std::string ServiceLockFile();  // /var/packages/Plovo/etc/service.lock
 std::string SettingFile();      // /var/packages/Plovo/etc/setting.conf
 std::string RegVolumeFile();    // /var/packages/Plovo/etc/veltpkg_conf/reg_volume
 std::string EnabledFile();      // /var/packages/Plovo/enabled

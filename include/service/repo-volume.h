@@ -10,12 +10,13 @@
 //
 // A move copies the repository into the target volume's "@tmp" first, so a
 // half-finished copy never looks like a repository, renames it into place,
-// and only then retires the old one (renamed into its own volume's "@tmp"
-// and deleted in the background). Until the rename into place succeeds the
-// old repository is untouched.
+// records the new volume, and only then retires the old one (renamed into
+// its own volume's "@tmp" and deleted in the background). Until the record
+// names the new volume the old repository is untouched.
 //
 // The functions run in the calling process and block while they copy; they
-// need root, and are not meant to run twice at once.
+// need root. Only ChangeRepoVolume may be called from several threads or
+// processes at once; it serialises itself.
 #ifndef PLOVO_SERVICE_REPO_VOLUME_H
 #define PLOVO_SERVICE_REPO_VOLUME_H
 
@@ -33,20 +34,27 @@ int MakeRepo(const std::string& volumePath);
 // False when either cannot be written.
 bool SetRepoVolumePath(const std::string& volumePath);
 
-// Moves from + "/@Plovo" to to + "/@Plovo" through to + "/@tmp/@Plovo",
-// creating the "@tmp" folder of either volume when it has none. False when
-// the copy or the rename into place fails; the old repository is then
-// whole and in its place. Refuses (false, nothing copied) when
-// to + "/@Plovo" already exists, since renaming onto it would bury the copy
-// inside it.
+// Copies from + "/@Plovo" to to + "/@Plovo" through to + "/@tmp/@Plovo"
+// (the volume's "@tmp" is created when it has none, and whatever an earlier
+// attempt left in the staging place is removed first). False when the copy
+// or the rename into place fails; the old repository is untouched either
+// way: RetireRepo removes it once the new volume is recorded. Refuses
+// (false, nothing copied) when to + "/@Plovo" already exists, since
+// renaming onto it would bury the copy inside it.
 bool move_repo_volume(const std::string& from, const std::string& to);
+
+// Renames from + "/@Plovo" to from + "/@tmp/@Plovo" and deletes it there in
+// the background. Failures are logged and leave it where it is.
+void RetireRepo(const std::string& from);
 
 // Moves the repository from the volume `from` (empty: there is none yet,
 // and one is created on `to`) to the volume `to`, stopping the service
-// first when the daemon runs and starting it again afterwards. True on
-// success, and at once when from equals to. A failed move starts the
-// service again on the old volume and leaves the state error (7) only when
-// that start fails too; any other failure after the stop leaves state 7.
+// first when the daemon runs and starting it again afterwards, all under
+// the ServiceLock. True on success, and at once when from equals to or the
+// repository is already recorded on `to`; false when it is recorded on
+// neither (another move came first). A failed copy starts the service
+// again on the old volume and leaves the state error (7) only when that
+// start fails too; any other failure after the stop leaves state 7.
 PLOVO_EXPORT bool ChangeRepoVolume(const std::string& from, const std::string& to);
 
 #endif

@@ -68,6 +68,27 @@ bool IsRepoValid(const std::string& volumePath);
 // present but the process gone, 3 no usable pid file.
 int StatusService();
 
+// Serialises the service's start, stop and repository move, between
+// processes and between threads, for the whole of each: two moves at once
+// would delete each other's copies, and a start beside a move would run
+// the installer on a half-copied repository. Blocks until the exclusive
+// flock on "/var/packages/Plovo/etc/service.lock" is taken. A thread that
+// holds it may take it again (a move stops and starts the service).
+class ServiceLock {
+ public:
+  ServiceLock();
+  ~ServiceLock();
+  ServiceLock(const ServiceLock&) = delete;
+  ServiceLock& operator=(const ServiceLock&) = delete;
+
+  // False when the lock file cannot be opened or locked (logged).
+  bool locked() const { return locked_; }
+
+ private:
+  int fd_ = -1;
+  bool locked_ = false;
+};
+
 // Brings the enabled package to a running daemon: settles the repository
 // volume (the recorded one, else an existing "@Plovo" on a mounted volume,
 // else the first mounted, writable, internal volume), creates the
@@ -76,16 +97,19 @@ int StatusService();
 // itself. States written on the way: 2, 3; 1 when no volume can hold the
 // repository (the daemon is then not started); 7 with "err_upgrade_failed"
 // or "err_sys" on a failure. 0 on success, when the package is disabled
-// (nothing is done) and in state 1; -1 on failure. Blocks while the
-// installer and the daemon's start run.
+// (nothing is done), when the daemon already runs (nothing is done) and in
+// state 1; -1 on failure. Blocks while the installer and the daemon's
+// start run, under the ServiceLock.
 PLOVO_EXPORT int StartService(void);
 
 // Stops the daemon: the "stop" command, then SIGTERM to the process of the
 // pid file, waiting up to ten seconds (probing every 100 ms) before
-// SIGKILL; then hides the scheduler entries and writes state 6. A pid file
-// whose process is gone is removed and counts as stopped. 0, or -1 when
-// there is no pid file or the signal cannot be sent (the state is then left
-// alone).
+// SIGKILL; then hides the scheduler entries and writes state 6. The daemon
+// holds its pid file under an exclusive flock for its whole life: a pid
+// file nobody holds, or whose process is gone, is stale, so it is removed
+// and counts as stopped, and the process it names (some other program by
+// now) is left alone. 0, or -1 when there is no pid file or the signal
+// cannot be sent (the state is then left alone). Under the ServiceLock.
 PLOVO_EXPORT int StopService(void);
 
 // Replaces the ten seconds StopService waits for the daemon to go before
