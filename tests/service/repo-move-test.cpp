@@ -109,6 +109,28 @@ TEST_F(RepoMoveTest, WithoutRepositoryOneIsMadeOnTheTargetAndNothingCopied) {
   EXPECT_EQ(ReadFile("/var/packages/Plovo/etc/status"), "state=\"4\"\nerror=\"\"\n");
 }
 
+// Two requests for the same move at once (a double click): the second
+// waits for the first and then finds the repository already there, rather
+// than clearing the staging place under the first one's copy.
+TEST_F(RepoMoveTest, TwoMovesAtOnceRunOneAfterTheOther) {
+  ASSERT_EQ(StartService(), 0);
+  for (int i = 0; i < 2000; ++i) {
+    WriteFile("/volume1/@Plovo/task/" + std::to_string(i % 20) + "/f" + std::to_string(i),
+              std::string(100 + i, 'x'));
+  }
+  const auto repo = Files("/volume1/@Plovo");
+  bool results[2] = {};
+  std::thread other([&] { results[0] = ChangeRepoVolume(Volume(1), Volume(2)); });
+  results[1] = ChangeRepoVolume(Volume(1), Volume(2));
+  other.join();
+  EXPECT_TRUE(results[0] && results[1]);
+  EXPECT_EQ(Files("/volume2/@Plovo"), repo);
+  EXPECT_TRUE(Recorded(Volume(2)));
+  EXPECT_EQ(ReadFile("/var/packages/Plovo/etc/status"), "state=\"4\"\nerror=\"\"\n");
+  for (int i = 0; i < 500 && Exists("/volume1/@tmp/@Plovo"); ++i)
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+}
+
 // A move from volume1 to volume2 while the service runs. Whether or not it
 // moves, the service ends up running on the volume that holds the repository.
 struct MoveCase {

@@ -136,40 +136,52 @@ TEST_F(ServiceStartTest, FailuresEndInTheErrorStateWithTheirTag) {
   }
 }
 
-// Stops of processes put in the pid file by hand: one that ignores SIGTERM,
-// one that has exited but is not yet collected, one long gone, none.
+// Stops of processes put in the pid file by hand. A daemon holds its pid
+// file's lock for its life; the scripts do so through fd 9, which the
+// command they exec keeps.
 TEST_F(ServiceStartTest, StopOfStubbornZombieStaleAndMissingDaemons) {
   SetStopServiceWait(300ms);
+  const std::string take = "exec 9>>$PLOVO_ROOT/var/run/plovod.pid; flock -n 9 || exit 1; ";
+  const std::string write = "echo $$ > $PLOVO_ROOT/var/run/plovod.pid; ";
   const struct {
-    const char* script;  // the daemon's; it writes its own pid file
+    std::string script;  // the daemon's; it writes its own pid file
     bool reapFirst;      // collected before the stop: its pid is stale
     int result;
     const char* logged;
-    int signal;  // what ended it
+    int signal;  // what ended it; for a process left alone, the test's SIGKILL
   } cases[] = {
-      {"trap '' TERM; echo $$ > $PLOVO_ROOT/var/run/plovod.pid; exec sleep 10", false, 0,
-       "forcelly kill daemon", SIGKILL},
-      {"echo $$ > $PLOVO_ROOT/var/run/plovod.pid", false, 0, "daemon is dead", 0},
-      {"echo $$ > $PLOVO_ROOT/var/run/plovod.pid", true, 0, "pid does not exist", 0},
-      {nullptr, false, -1, "Failed to kill daemon", 0},
+      {take + "trap '' TERM; " + write + "exec sleep 10", false, 0, "forcelly kill daemon", SIGKILL},
+      // Ended by SIGTERM but not yet collected (a zombie): gone all the same.
+      {take + write + "exec sleep 10", false, 0, "daemon is dead", SIGTERM},
+      {take + write, true, 0, "pid does not exist", 0},
+      // Nobody holds the pid file: the number is another program's by now.
+      {write + "exec sleep 10", false, 0, "pid does not exist", SIGKILL},
+      {"", false, -1, "Failed to kill daemon", 0},
   };
   const std::string pidFile = Path("/var/run/plovod.pid");
   for (const auto& c : cases) {
     SCOPED_TRACE(c.logged);
     WriteStatus(4, "");
-    const pid_t pid = c.script ? fork() : -1;
-    if (pid == 0) execl("/bin/sh", "sh", "-c", c.script, static_cast<char*>(nullptr)), _exit(127);
+    const bool locked = c.script.rfind(take, 0) == 0;
+    const pid_t pid = c.script.empty() ? -1 : fork();
+    if (pid == 0) execl("/bin/sh", "sh", "-c", c.script.c_str(), static_cast<char*>(nullptr)), _exit(127);
     for (int i = 0; pid > 0 && i < 500 && VLIBCReadPidFile(pidFile.c_str()) != pid; ++i)
       std::this_thread::sleep_for(10ms);
     siginfo_t info{};
-    if (pid > 0 && !c.signal) waitid(P_PID, pid, &info, WEXITED | (c.reapFirst ? 0 : WNOWAIT));
+    if (c.reapFirst) waitid(P_PID, pid, &info, WEXITED);
     plovo_test::LogCapture log;
     EXPECT_EQ(StopService(), c.result);
     EXPECT_TRUE(log.Contains(c.logged)) << log.Dump();
     EXPECT_EQ(State(), StateIs(c.result == 0 ? 6 : 4, ""));
-    EXPECT_EQ(Exists("/var/run/plovod.pid"), pid > 0 && !c.reapFirst);
+    EXPECT_EQ(Exists("/var/run/plovod.pid"), locked && !c.reapFirst);
     int status = 0;
-    if (pid > 0 && !c.reapFirst) waitpid(pid, &status, 0);
+    if (pid > 0 && !c.reapFirst) {
+      if (!locked) {
+        EXPECT_EQ(kill(pid, 0), 0) << "a process that is not the daemon was signalled";
+        kill(pid, SIGKILL);
+      }
+      waitpid(pid, &status, 0);
+    }
     EXPECT_EQ(WIFSIGNALED(status) ? WTERMSIG(status) : 0, c.signal) << status;
     unlink(pidFile.c_str());
   }
@@ -191,6 +203,9 @@ TEST_F(ServiceStartTest, ServiceHostExitCodesAndStatusLine) {
   const std::string module = "--module " PLOVO_MODULE_PATH " ";
   EXPECT_EQ(run(module + "status"), 1);  // no status file yet
   EXPECT_EQ(run(module + "start"), 0);
+  const int pid = VLIBCReadPidFile(Path("/var/run/plovod.pid").c_str());
+  EXPECT_EQ(run(module + "start"), 0);  // the daemon runs: nothing to do
+  EXPECT_EQ(VLIBCReadPidFile(Path("/var/run/plovod.pid").c_str()), pid);
   EXPECT_EQ(run(module + "status"), 0);
   EXPECT_EQ(out, "{\"state\":4,\"error\":\"\"}\n");
   EXPECT_EQ(run(module + "stats"), 0);
