@@ -18,8 +18,20 @@
 
 namespace {
 
-std::string LogDBPath(const std::string& volume) {
-  return volume + "/@Plovo/db" + "/" + "log-db.sqlite";
+// Opens the volume's log database and reads how many records it keeps. A
+// failure answers 412 naming the step that failed.
+bool OpenLogDB(const std::string& volume, LogDB& db, unsigned long& count,
+               VELT::APIResponse* response) {
+  const char* failed = nullptr;
+  if (db.Initialize(volume + "/@Plovo/db" + "/" + "log-db.sqlite") != 0) {
+    failed = "Failed to init log db";
+  } else if (db.GetRotationCount(count) != 0) {
+    failed = "Failed to get log rotation count";
+  }
+  if (!failed) return true;
+  PLOVO_LOG(LOG_ERR, "%s", failed);
+  response->SetError(412, Json::Value(failed));
+  return false;
 }
 
 // Adds one entry's size to the total in context; symbolic links add
@@ -75,17 +87,8 @@ void PlovoHandle::GetGlobalSetting() {
     return;
   }
   LogDB db;
-  if (db.Initialize(LogDBPath(volume)) != 0) {
-    PLOVO_LOG(LOG_ERR, "Failed to init log db");
-    response->SetError(412, Json::Value("Failed to init log db"));
-    return;
-  }
   unsigned long count = 0;
-  if (db.GetRotationCount(count) != 0) {
-    PLOVO_LOG(LOG_ERR, "Failed to get log rotation count");
-    response->SetError(412, Json::Value("Failed to get log rotation count"));
-    return;
-  }
+  if (!OpenLogDB(volume, db, count, response)) return;
   data["log_rotate_count"] = Json::UInt64(count);
   response->SetSuccess(data);
 }
@@ -140,17 +143,8 @@ void PlovoHandle::SetGlobalSetting() {
   const std::string current = Plovo::GlobalSetting::GetRepoVolumePath();
   if (!current.empty()) {
     LogDB db;
-    if (db.Initialize(LogDBPath(current)) != 0) {
-      PLOVO_LOG(LOG_ERR, "Failed to init log db");
-      response->SetError(412, Json::Value("Failed to init log db"));
-      return;
-    }
     unsigned long count = 0;
-    if (db.GetRotationCount(count) != 0) {
-      PLOVO_LOG(LOG_ERR, "Failed to get log rotation count");
-      response->SetError(412, Json::Value("Failed to get log rotation count"));
-      return;
-    }
+    if (!OpenLogDB(current, db, count, response)) return;
     if (count != rotate.Get() && db.UpdateRotationCount(rotate.Get()) != 0) {
       PLOVO_LOG(LOG_ERR, "Failed to set log rotation count");
       response->SetError(412, Json::Value("Failed to set log rotation count"));
