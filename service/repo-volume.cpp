@@ -56,7 +56,16 @@ bool RemoveNow(const std::string& path) {
   return true;
 }
 
+// An empty volume would make every path below one at the top of the
+// system.
+bool IsVolumePath(const std::string& volume) {
+  if (!volume.empty()) return true;
+  PLOVO_LOG(LOG_ERR, "invalid volume path [%s].", volume.c_str());
+  return false;
+}
+
 bool MoveRepo(const std::string& from, const std::string& to) {
+  if (!IsVolumePath(from) || !IsVolumePath(to)) return false;
   const std::string src = from + "/@Plovo";
   const std::string dst = to + "/@Plovo";
   const std::string dstTmp = to + "/@tmp" + "/@Plovo";
@@ -88,6 +97,7 @@ bool MoveRepo(const std::string& from, const std::string& to) {
 }  // namespace
 
 void RetireRepo(const std::string& from) {
+  if (!IsVolumePath(from)) return;
   const std::string src = from + "/@Plovo";
   const std::string srcTmp = from + "/@tmp" + "/@Plovo";
   // Without its temporary folder (a volume gone read-only, say) the old
@@ -174,10 +184,7 @@ bool ChangeRepo(const std::string& from, const std::string& to) {
 }  // namespace
 
 int MakeRepo(const std::string& volumePath) {
-  if (volumePath.empty()) {
-    PLOVO_LOG(LOG_ERR, "invalid volume path [%s].", volumePath.c_str());
-    return -1;
-  }
+  if (!IsVolumePath(volumePath)) return -1;
   const std::string repo = volumePath + "/@Plovo";
   if (FSMKDir(repo, true, kUnchangedId, kUnchangedId) != 0) {
     PLOVO_LOG(LOG_ERR, "fail to create plovo repo [%s].", repo.c_str());
