@@ -1,6 +1,8 @@
 #include "service/repo-volume.h"
 
+#include <fcntl.h>
 #include <json/writer.h>
+#include <unistd.h>
 #include <velt/vlibc.h>
 
 #include <cerrno>
@@ -11,6 +13,7 @@
 #include "common/log.h"
 #include "common/no-throw.h"
 #include "common/paths.h"
+#include "common/unique-fd.h"
 #include "service/global-setting.h"
 #include "service/service-ctrl.h"
 
@@ -26,11 +29,13 @@ bool ReplaceFile(const std::string& file, const std::string& text) {
       FSMKDir(file.substr(0, slash), true, kUnchangedId, kUnchangedId) != 0) {
     return false;
   }
+  // A link in the temporary file's place is not followed out of the folder.
   const std::string tmp = file + ".tmp";
-  FILE* out = std::fopen(tmp.c_str(), "w");
-  if (!out) return false;
-  const bool written = std::fwrite(text.data(), 1, text.size(), out) == text.size();
-  if (std::fclose(out) != 0 || !written || std::rename(tmp.c_str(), file.c_str()) != 0) {
+  std::remove(tmp.c_str());
+  Plovo::UniqueFd fd(open(tmp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0644));
+  if (!fd) return false;
+  const bool written = write(fd.get(), text.data(), text.size()) == static_cast<ssize_t>(text.size());
+  if (!written || std::rename(tmp.c_str(), file.c_str()) != 0) {
     std::remove(tmp.c_str());
     return false;
   }

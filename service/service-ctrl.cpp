@@ -457,7 +457,8 @@ int EndDaemon(int pid) {
 // Whether some process holds the pid file's lock, as the daemon does for
 // its whole life.
 bool PidFileHeld(const std::string& pidFile) {
-  Plovo::UniqueFd fd(open(pidFile.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
+  // Without O_NONBLOCK a FIFO put in its place would hold the stop forever.
+  Plovo::UniqueFd fd(open(pidFile.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
   if (!fd) return false;
   if (flock(fd.get(), LOCK_SH | LOCK_NB) == 0) {
     flock(fd.get(), LOCK_UN);
