@@ -4,7 +4,6 @@
 #include <cstring>
 #include <filesystem>
 #include <map>
-#include <regex>
 #include <thread>
 
 #include "log-capture.h"
@@ -41,7 +40,8 @@ class RepoMoveTest : public plovo_test::ServiceSandboxTest, public testing::With
     std::error_code ec;
     for (std::filesystem::recursive_directory_iterator it(Path(dir), ec), end; !ec && it != end; it.increment(ec)) {
       const std::string name = it->path().string().substr(Path(dir).size());
-      if (!std::regex_search(name, std::regex("-(wal|shm)$")))
+      const std::string ext = it->path().extension().string();
+      if (ext != ".sqlite-wal" && ext != ".sqlite-shm")
         files[name] = it->is_directory() ? "/" : std::to_string(std::hash<std::string>()(ReadFile(dir + name)));
     }
     return files;
