@@ -12,6 +12,7 @@
 #include <atomic>
 #include <cerrno>
 #include <chrono>
+#include <climits>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -297,6 +298,59 @@ bool WriteState(int state) {
   return SetServiceStatus(status) == 0;
 }
 
+// Whether the process pid has ended. One that has exited but is not yet
+// collected by its parent (init, for a daemon) still answers signal 0,
+// for as long as the parent takes; it is gone all the same.
+bool ProcessGone(int pid) {
+  if (kill(pid, 0) != 0) return errno == ESRCH;
+  char path[32];
+  std::snprintf(path, sizeof path, "/proc/%d/stat", pid);
+  FILE* file = std::fopen(path, "re");
+  if (!file) return errno == ENOENT;
+  char line[512] = {};
+  const size_t n = std::fread(line, 1, sizeof line - 1, file);
+  std::fclose(file);
+  // "<pid> (<name>) <state> ...": the name may hold ") " itself.
+  const char* close = std::strrchr(line, ')');
+  return n > 0 && close && (close[1] == ' ') && (close[2] == 'Z' || close[2] == 'X');
+}
+
+// Whether some process holds the pid file's lock, as the daemon does for
+// its whole life.
+bool PidFileHeld(const std::string& pidFile) {
+  // Without O_NONBLOCK a FIFO put in its place would hold the stop forever.
+  Plovo::UniqueFd fd(open(pidFile.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
+  if (!fd) return false;
+  if (flock(fd.get(), LOCK_SH | LOCK_NB) == 0) {
+    flock(fd.get(), LOCK_UN);
+    return false;
+  }
+  return errno == EWOULDBLOCK;
+}
+
+// Whether pid runs the package's daemon program (reached through whatever
+// link names it).
+bool RunsDaemonProgram(int pid) {
+  char link[32];
+  std::snprintf(link, sizeof link, "/proc/%d/exe", pid);
+  char exe[PATH_MAX];
+  const ssize_t n = readlink(link, exe, sizeof exe - 1);
+  if (n <= 0) return false;
+  exe[n] = '\0';
+  char* program = realpath(Plovo::Path::DaemonProgram().c_str(), nullptr);
+  const bool same = program && std::strcmp(program, exe) == 0;
+  std::free(program);
+  return same;
+}
+
+// Whether the process a pid file names is the package's daemon. A pid file
+// outlives a daemon that crashed, and after a restart its number may be
+// any other program's, which must be neither signalled nor taken for a
+// running daemon.
+bool IsDaemon(int pid, const std::string& pidFile) {
+  return PidFileHeld(pidFile) || RunsDaemonProgram(pid);
+}
+
 // Settles which volume holds the repository before anything is prepared
 // on it. 1: repo is usable; 0: no volume can hold one (state 1 written,
 // the start ends there with result); -1: the start fails.
@@ -389,7 +443,9 @@ int Start() {
   if (!lock.locked()) return -1;
   // A second daemon would refuse to start, and the installer would run
   // under the first one's feet.
-  if (StatusService() == 0) {
+  const std::string pidFile = Plovo::Path::DaemonPidFile();
+  const int pid = VLIBCReadPidFile(pidFile.c_str());
+  if (pid >= 1 && !ProcessGone(pid) && IsDaemon(pid, pidFile)) {
     PLOVO_LOG(LOG_INFO, "daemon is already running");
     return 0;
   }
@@ -404,23 +460,6 @@ int Start() {
   if (status.error.empty()) status.error = "err_sys";
   if (SetServiceStatus(status) != 0) PLOVO_LOG(LOG_ERR, "fail to update plovo status to error.");
   return -1;
-}
-
-// Whether the process pid has ended. One that has exited but is not yet
-// collected by its parent (init, for a daemon) still answers signal 0,
-// for as long as the parent takes; it is gone all the same.
-bool ProcessGone(int pid) {
-  if (kill(pid, 0) != 0) return errno == ESRCH;
-  char path[32];
-  std::snprintf(path, sizeof path, "/proc/%d/stat", pid);
-  FILE* file = std::fopen(path, "re");
-  if (!file) return errno == ENOENT;
-  char line[512] = {};
-  const size_t n = std::fread(line, 1, sizeof line - 1, file);
-  std::fclose(file);
-  // "<pid> (<name>) <state> ...": the name may hold ") " itself.
-  const char* close = std::strrchr(line, ')');
-  return n > 0 && close && (close[1] == ' ') && (close[2] == 'Z' || close[2] == 'X');
 }
 
 // Ends the daemon of pid, which has been asked to stop: SIGTERM, then
@@ -454,30 +493,15 @@ int EndDaemon(int pid) {
   return 0;
 }
 
-// Whether some process holds the pid file's lock, as the daemon does for
-// its whole life.
-bool PidFileHeld(const std::string& pidFile) {
-  // Without O_NONBLOCK a FIFO put in its place would hold the stop forever.
-  Plovo::UniqueFd fd(open(pidFile.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
-  if (!fd) return false;
-  if (flock(fd.get(), LOCK_SH | LOCK_NB) == 0) {
-    flock(fd.get(), LOCK_UN);
-    return false;
-  }
-  return errno == EWOULDBLOCK;
-}
-
 int Stop() {
   ServiceLock lock;
   if (!lock.locked()) return -1;
   const std::string pidFile = Plovo::Path::DaemonPidFile();
   // Read before the stop command: a daemon that obeys it removes its pid
   // file on the way out, and the process would then be lost from sight
-  // while it may still be finishing. A pid file that nobody holds is left
-  // over from a daemon that is gone; its number may belong to another
-  // program by now, which must not be signalled.
+  // while it may still be finishing.
   const int pid = VLIBCReadPidFile(pidFile.c_str());
-  const bool stale = pid >= 1 && !PidFileHeld(pidFile);
+  const bool stale = pid >= 1 && !IsDaemon(pid, pidFile);
 
   PObject command;
   command["action"] = "stop";
