@@ -147,7 +147,7 @@ bool ChangeRepo(const std::string& from, const std::string& to) {
     return false;
   }
 
-  if (StatusService() == 0 && StopService() != 0) {
+  if (StatusService() == 0 && StopServiceLocked() != 0) {
     PLOVO_LOG(LOG_ERR, "failed to StopService()");
     return false;
   }
@@ -164,7 +164,7 @@ bool ChangeRepo(const std::string& from, const std::string& to) {
                 to.c_str());
       // The old repository is whole and still recorded: a user is better
       // served by the package running where it was than by a stopped one.
-      if (StartService() != 0) {
+      if (StartServiceLocked() != 0) {
         PLOVO_LOG(LOG_ERR, "failed to StartService()");
         return FailChange();
       }
@@ -179,7 +179,7 @@ bool ChangeRepo(const std::string& from, const std::string& to) {
   // it is the one the record names.
   if (!SetRepoVolumePath(to)) return FailChange();
   if (!from.empty()) RetireRepo(from);
-  if (StartService() != 0) {
+  if (StartServiceLocked() != 0) {
     PLOVO_LOG(LOG_ERR, "failed to StartService()");
     return FailChange();
   }

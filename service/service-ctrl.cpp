@@ -226,11 +226,6 @@ constexpr std::chrono::milliseconds kStopWait = std::chrono::seconds(10);
 constexpr std::chrono::milliseconds kStopProbe{100};
 std::atomic<std::chrono::milliseconds::rep> gStopWaitMs{kStopWait.count()};
 
-// How many ServiceLock objects the thread holds; only the outermost takes
-// and releases the flock, which a second open of the file in the same
-// process would wait for forever.
-thread_local int tServiceLockDepth = 0;
-
 // The volumes the platform knows, freed with the object.
 class VolumeList {
  public:
@@ -439,8 +434,6 @@ int Start() {
   ServiceStatus status;
   UpdaterCore updater;
   if (!IsPkgEnable()) return 0;
-  ServiceLock lock;
-  if (!lock.locked()) return -1;
   // A second daemon would refuse to start, and the installer would run
   // under the first one's feet.
   const std::string pidFile = Plovo::Path::DaemonPidFile();
@@ -494,8 +487,6 @@ int EndDaemon(int pid) {
 }
 
 int Stop() {
-  ServiceLock lock;
-  if (!lock.locked()) return -1;
   const std::string pidFile = Plovo::Path::DaemonPidFile();
   // Read before the stop command: a daemon that obeys it removes its pid
   // file on the way out, and the process would then be lost from sight
@@ -538,11 +529,6 @@ int Stop() {
 }  // namespace
 
 ServiceLock::ServiceLock() {
-  if (tServiceLockDepth > 0) {
-    ++tServiceLockDepth;
-    locked_ = true;
-    return;
-  }
   fd_ = open(Plovo::Path::ServiceLockFile().c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600);
   if (fd_ < 0) {
     PLOVO_LOG(LOG_ERR, "Failed to open plovo service lock file.");
@@ -557,13 +543,10 @@ ServiceLock::ServiceLock() {
     fd_ = -1;
     return;
   }
-  ++tServiceLockDepth;
   locked_ = true;
 }
 
 ServiceLock::~ServiceLock() {
-  if (!locked_) return;
-  --tServiceLockDepth;
   if (fd_ >= 0) close(fd_);  // releases the flock
 }
 
@@ -571,6 +554,18 @@ void SetStopServiceWait(std::chrono::milliseconds wait) {
   gStopWaitMs.store(wait.count() > 0 ? wait.count() : kStopWait.count());
 }
 
-int StartService(void) { return Plovo::NoThrow(Start, -1); }
+int StartServiceLocked() { return Plovo::NoThrow(Start, -1); }
 
-int StopService(void) { return Plovo::NoThrow(Stop, -1); }
+int StopServiceLocked() { return Plovo::NoThrow(Stop, -1); }
+
+int StartService(void) {
+  // A disabled package is left exactly as it is, lock file included.
+  if (!IsPkgEnable()) return 0;
+  ServiceLock lock;
+  return lock.locked() ? StartServiceLocked() : -1;
+}
+
+int StopService(void) {
+  ServiceLock lock;
+  return lock.locked() ? StopServiceLocked() : -1;
+}

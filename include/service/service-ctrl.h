@@ -72,8 +72,8 @@ int StatusService();
 // processes and between threads, for the whole of each: two moves at once
 // would delete each other's copies, and a start beside a move would run
 // the installer on a half-copied repository. Blocks until the exclusive
-// flock on "/var/packages/Plovo/etc/service.lock" is taken. A thread that
-// holds it may take it again (a move stops and starts the service).
+// flock on "/var/packages/Plovo/etc/service.lock" is taken. Not
+// re-entrant: whoever holds it calls the ...Locked functions below.
 class ServiceLock {
  public:
   ServiceLock();
@@ -111,6 +111,12 @@ PLOVO_EXPORT int StartService(void);
 // now) is left alone. 0, or -1 when there is no pid file or the signal
 // cannot be sent (the state is then left alone). Under the ServiceLock.
 PLOVO_EXPORT int StopService(void);
+
+// StartService and StopService for a caller that already holds the
+// ServiceLock: a repository move stops and starts the service under its
+// own.
+int StartServiceLocked();
+int StopServiceLocked();
 
 // Replaces the ten seconds StopService waits for the daemon to go before
 // it kills it; zero or less restores them. For tests.
