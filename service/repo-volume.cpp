@@ -152,7 +152,15 @@ bool ChangeRepo(const std::string& from, const std::string& to) {
     return false;
   }
 
-  if (!from.empty()) {
+  // A volume that is gone (unmounted, removed) holds nothing to copy: the
+  // user has chosen where to begin again, and the old repository stays
+  // where it is for the day the volume comes back.
+  const bool hasRepo = !from.empty() && IsFileExist(from + "/@Plovo");
+  if (!from.empty() && !hasRepo) {
+    PLOVO_LOG(LOG_ERR, "repo volume [%s] holds no repository, create one on [%s].", from.c_str(),
+              to.c_str());
+  }
+  if (hasRepo) {
     ServiceStatus moving;
     moving.state = PLOVO_SERVICE_STATUS_MOVING_REPO;
     if (SetServiceStatus(moving) != 0) {
@@ -178,7 +186,7 @@ bool ChangeRepo(const std::string& from, const std::string& to) {
   // The old repository goes only once the new one is recorded: until then
   // it is the one the record names.
   if (!SetRepoVolumePath(to)) return FailChange();
-  if (!from.empty()) RetireRepo(from);
+  if (hasRepo) RetireRepo(from);
   if (StartServiceLocked() != 0) {
     PLOVO_LOG(LOG_ERR, "failed to StartService()");
     return FailChange();

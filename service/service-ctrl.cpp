@@ -362,6 +362,18 @@ int SettleRepoVolume(std::string& repo, int& result) {
     }
   }
   if (IsRepoValid(repo)) return 1;
+  // A recorded volume that is gone (not mounted at boot, removed) holds no
+  // repository to move. Choosing another volume here would hide the old
+  // one when it comes back; the user chooses instead, in state 1, and
+  // until then the record keeps naming the old volume.
+  if (!repo.empty() && !IsFileExist(repo + "/@Plovo")) {
+    PLOVO_LOG(LOG_ERR, "Repo volume [%s] holds no repository.", repo.c_str());
+    if (!WriteState(PLOVO_SERVICE_STATUS_NO_REPO)) {
+      PLOVO_LOG(LOG_ERR, "fail to SetServiceStatus()");
+      result = -1;
+    }
+    return 0;
+  }
 
   const std::string chosen = ChooseRepoVolume();
   if (chosen.empty()) {

@@ -141,7 +141,9 @@ void PlovoHandle::SetGlobalSetting() {
   }
 
   const std::string current = Plovo::GlobalSetting::GetRepoVolumePath();
-  if (!current.empty()) {
+  // The count lives in the repository's log database; a volume that is gone
+  // has none to keep it, and must not stop the user choosing another.
+  if (IsRepoMounted(current)) {
     LogDB db;
     unsigned long count = 0;
     if (!OpenLogDB(current, db, count, response)) return;

@@ -33,6 +33,12 @@ TEST_F(ServiceStartTest, DisabledPackageOrNoUsableVolumeStartsNoDaemon) {
   EXPECT_EQ(StartService(), 0);
   EXPECT_EQ(Status(), StateIs(1));
   EXPECT_TRUE(Recorded(""));
+  // The recorded volume is gone: nothing is made elsewhere, the user chooses.
+  DeclareVolumes({{"volume1"}});
+  WriteFile("/var/packages/Plovo/etc/setting.conf", "repo_vol_path=\"" + Path("/volume9") + "\"\n");
+  EXPECT_EQ(StartService(), 0);
+  EXPECT_EQ(Status(), StateIs(1));
+  EXPECT_FALSE(Exists("/volume1/@Plovo"));
 }
 
 // Through plovo-service: a repository found on the second volume is reused,

@@ -91,6 +91,18 @@ TEST_F(GlobalSettingTest, SetStoresBeepAndCountAndTellsOnlyARunningDaemon) {
 
 // Targets that cannot hold the repository, and room for its tree on the
 // target: a link to a file outside the repository counts nothing.
+// The recorded volume is gone: the user begins again on another one.
+TEST_F(GlobalSettingTest, SetLeavesAVolumeThatIsGone) {
+  WriteStatus(1, "");
+  WriteFile("/var/packages/Plovo/etc/setting.conf", "repo_vol_path=\"" + Path("/volume9") + "\"\n");
+  MakeDir("/volume2");
+  Volumes(R"({"path": "volume2"})");
+  plovo_test::LogCapture log;
+  EXPECT_TRUE(Call("set_global_setting", Params("/volume2")).IsSuccess()) << log.Dump();
+  EXPECT_TRUE(Exists("/volume2/@Plovo/db"));
+  EXPECT_EQ(Plovo::GlobalSetting::GetRepoVolumePath(), Path("/volume2"));
+}
+
 TEST_F(GlobalSettingTest, SetChecksTheTargetBeforeMoving) {
   WriteStatus(1, "");
   const std::string longName = "/v" + std::string(62 - Root().size(), 'x');  // 64 bytes in all
