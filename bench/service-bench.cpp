@@ -1,7 +1,7 @@
 // The service control's two slow operations, each against a baseline in the
 // same run.
 //
-// Stop (`stop_service`): StopService with a daemon (plovod-dev) that exits
+// Stop (`stop_service`): StopService with a daemon (plovod) that exits
 // on the stop command. Each iteration starts the service untimed
 // (StartService, which starts the daemon) and times the stop. Baseline
 // (`stop_raw`): the same stop command through DaemonIPC, then a probe of
@@ -89,7 +89,7 @@ void MakeSandbox() {
   if (!SetRepoVolumePath(gRoot + "/svc")) plovo_bench::Die("record the service's volume");
   const std::string daemon = Plovo::Path::DaemonProgram();
   unlink(daemon.c_str());
-  if (symlink(PLOVOD_DEV_PATH, daemon.c_str()) != 0) plovo_bench::Die("symlink " + daemon);
+  if (symlink(PLOVOD_PATH, daemon.c_str()) != 0) plovo_bench::Die("symlink " + daemon);
 }
 
 // ---- Stop ----------------------------------------------------------------

@@ -213,6 +213,14 @@ bool ShowAllSchedule() { return SetAllListable(true); }
 
 bool HideAllSchedule() { return SetAllListable(false); }
 
+bool RemoveSchedule(int64_t scheduleId) {
+  if (VELTSchedTaskRemove(scheduleId) < 0 && VLIBCErrGet() != VLIBC_ERR_NOT_FOUND) {
+    PLOVO_LIB_ERR("Failed to remove schedule %lld\n", static_cast<long long>(scheduleId));
+    return false;
+  }
+  return true;
+}
+
 bool RemoveAllSchedule() {
   return ForEachPackageEntry([](PVELTSCHEDTASK task) {
     int64_t id = -1;

@@ -37,6 +37,8 @@ bool UpdateScheduleContent(int64_t scheduleId, bool enabled, const std::string& 
 // list cannot be read.
 bool ShowAllSchedule();
 bool HideAllSchedule();
+// Deletes the entry; one that is gone already counts as deleted.
+bool RemoveSchedule(int64_t scheduleId);
 // Deletes every entry of the package; one that cannot be deleted is skipped.
 // False only when the list cannot be read.
 bool RemoveAllSchedule();

@@ -1,4 +1,4 @@
-// The repository's move between volumes, with plovod-dev running as the
+// The repository's move between volumes, with plovod running as the
 // package's daemon.
 #include <cerrno>
 #include <cstring>

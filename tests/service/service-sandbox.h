@@ -1,4 +1,4 @@
-// The package enabled, its folders, plovod-dev as its daemon program and two
+// The package enabled, its folders, plovod as its daemon program and two
 // volumes: where the service start and the repository move tests begin.
 #ifndef PLOVO_TESTS_SERVICE_SERVICE_SANDBOX_H
 #define PLOVO_TESTS_SERVICE_SERVICE_SANDBOX_H
@@ -24,7 +24,7 @@ class ServiceSandboxTest : public SandboxTest {
       MakeDir(dir);
     WriteFile("/var/packages/Plovo/enabled", "");
     WriteFile("/etc.defaults/veltinfo.conf", "plovo=\"yes\"\n");
-    symlink(PLOVOD_DEV_PATH, Path(kDaemon).c_str());
+    symlink(PLOVOD_PATH, Path(kDaemon).c_str());
     DeclareVolumes({{"volume1"}, {"volume2"}});
   }
   // A daemon a test started, and a tmpfs it mounted on volume2, go before its sandbox.

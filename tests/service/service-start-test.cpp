@@ -1,4 +1,4 @@
-// StartService and StopService with plovod-dev (or a small script) as the
+// StartService and StopService with plovod (or a small script) as the
 // package's daemon program, and plovo-service as their host.
 #include <sys/wait.h>
 

@@ -1,0 +1,96 @@
+// The daemon's running work: at most one run per task, each on a thread of
+// its own, so that a long copy never delays a command. A run can be
+// cancelled and ends within a second; every run is cancelled and waited
+// for when the daemon stops.
+#ifndef PLOVO_DAEMON_RUNNER_H
+#define PLOVO_DAEMON_RUNNER_H
+
+#include <atomic>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+
+namespace plovod {
+
+// What one run does, fixed when it starts.
+struct RunPlan {
+  unsigned long id = 0;
+  std::string source;        // the folder copied from
+  std::string destination;   // the folder copied into
+  std::string device_share;  // the device's share: pulling it out cancels the run
+  bool eject = false;        // eject the device after a successful run
+};
+
+// A run as its job sees it. Thread-safe.
+class RunControl {
+ public:
+  bool Cancelled() const { return cancelled_; }
+  void Cancel() { cancelled_ = true; }
+  // The file being copied now ("" between files), shown in the task list.
+  void SetCopying(const std::string& path);
+  std::string Copying() const;
+
+ private:
+  std::atomic<bool> cancelled_{false};
+  mutable std::mutex mutex_;
+  std::string copying_;
+};
+
+// Copies plan.source into plan.destination, looking at control between
+// blocks: 0, or a negative code of ipc/error-code.h (P_ERR_STOPPED when
+// cancelled).
+using Job = std::function<int(const RunPlan& plan, RunControl& control)>;
+
+class Runner {
+ public:
+  // finished is called on the run's thread with the job's result, before
+  // the task counts as idle again.
+  using Finished = std::function<void(const RunPlan& plan, int error)>;
+  Runner(Job job, Finished finished) : job_(std::move(job)), finished_(std::move(finished)) {}
+  ~Runner() { StopAll(); }
+  Runner(const Runner&) = delete;
+  Runner& operator=(const Runner&) = delete;
+
+  // False when the task runs already.
+  bool Start(const RunPlan& plan);
+  // False when the task does not run. Returns at once; the run ends soon.
+  bool Cancel(unsigned long id);
+  // Cancels the runs that copy from or to the device shared as share.
+  void CancelOnShare(const std::string& share);
+  bool IsRunning(unsigned long id) const;
+  // The file a run copies now; "" when none or the task does not run.
+  std::string Copying(unsigned long id) const;
+  // Cancels every run, waits for them, and refuses new ones from then on.
+  void StopAll();
+
+ private:
+  struct Run {
+    RunPlan plan;
+    RunControl control;
+    std::thread thread;
+    bool done = false;  // guarded by mutex_
+  };
+  // Joins the runs that have ended. Called with mutex_ held.
+  void Reap();
+
+  Job job_;
+  Finished finished_;
+  mutable std::mutex mutex_;
+  std::map<unsigned long, std::unique_ptr<Run>> runs_;
+  bool stopping_ = false;
+};
+
+// The job of a run until the copy engine takes over: every regular file of
+// the source tree that the destination does not hold with the same size
+// and modification time is copied, through a temporary name in its
+// destination folder, synced, and renamed into place. Links, other special
+// files and the platform's "@eaDir" folders are left out; nothing is ever
+// removed.
+int CopyNewFiles(const RunPlan& plan, RunControl& control);
+
+}  // namespace plovod
+
+#endif
