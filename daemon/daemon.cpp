@@ -187,12 +187,10 @@ const std::map<std::string, Daemon::Handler>& Daemon::Table() {
   return table;
 }
 
-std::vector<CommandServer::Command> Daemon::Commands() const {
+std::vector<CommandServer::Command> Daemon::Commands() {
   std::vector<CommandServer::Command> commands;
-  for (const auto& [action, handler] : Table()) {
-    commands.push_back({action, [this](const PObject& request) {
-                          return const_cast<Daemon*>(this)->Handle(request);
-                        }});
+  for (const auto& entry : Table()) {
+    commands.push_back({entry.first, [this](const PObject& request) { return Handle(request); }});
   }
   return commands;
 }
@@ -434,7 +432,6 @@ Code Daemon::StartRun(const StoredTask& task, std::string& why) {
   plan.source = IsExport(info) ? nas : usb;
   plan.destination = IsExport(info) ? usb : nas;
   plan.device_share = device.share_name;
-  plan.eject = task.device.eject_when_task_done;
   if (!runner_.Start(plan)) {
     why = "the task is running";
     return kConflict;

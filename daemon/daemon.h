@@ -36,7 +36,7 @@ class Daemon {
   // Opens the task database; 0, or -1 (logged).
   int Open() { return store_.Open(); }
   // Every action with its handler, for the CommandServer.
-  std::vector<CommandServer::Command> Commands() const;
+  std::vector<CommandServer::Command> Commands();
   // The answer to an action that is not in the table.
   PObject Unknown(const PObject& request);
   // The answer to one request, whatever its action.

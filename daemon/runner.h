@@ -21,7 +21,6 @@ struct RunPlan {
   std::string source;        // the folder copied from
   std::string destination;   // the folder copied into
   std::string device_share;  // the device's share: pulling it out cancels the run
-  bool eject = false;        // eject the device after a successful run
 };
 
 // A run as its job sees it. Thread-safe.

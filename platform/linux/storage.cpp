@@ -1,7 +1,12 @@
 // Shares and removable devices, declared in velt-dev/storage.json under the
-// sandbox root, and the file-system identity of a device read with
-// libblkid.
+// sandbox root (which an eject rewrites), and the file-system identity of a
+// device read with libblkid.
 #include <blkid/blkid.h>
+#include <fcntl.h>
+#include <json/writer.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstdlib>
@@ -10,6 +15,7 @@
 #include <vector>
 
 #include "dev-internal.h"
+#include "velt/log.h"
 #include "velt/share.h"
 #include "velt/storage.h"
 
@@ -60,16 +66,25 @@ bool ParseShare(const Json::Value& entry, Share* share) {
   return true;
 }
 
-// Reads storage.json (a missing file declares nothing). The shares are
-// checked strictly; the "devices" member is the storage service's answer
-// and is handed on as it stands, whatever its shape. Sets the last error
-// on failure.
-bool LoadStorage(std::vector<Share>* shares, Json::Value* devices) {
-  Json::Value doc;
-  int read = velt_dev::ReadJsonState("storage.json", &doc);
-  if (read == 0) doc = Json::Value(Json::objectValue);
-  const Json::Value& declared = read < 0 || !doc.isObject() ? doc : doc["shares"];
-  if (read < 0 || !doc.isObject() || !(declared.isNull() || declared.isArray())) {
+// Reads storage.json into *doc; a missing file declares nothing (an empty
+// object). Sets the last error when the file cannot be read or is not JSON.
+bool ReadStorage(Json::Value* doc) {
+  const int read = velt_dev::ReadJsonState("storage.json", doc);
+  if (read == 0) *doc = Json::Value(Json::objectValue);
+  if (read < 0) {
+    VELT_FAIL(VLIBC_ERR_BAD_CONFIG);
+    return false;
+  }
+  return true;
+}
+
+// Checks a storage.json document. The shares are checked strictly and
+// give one Share per entry, in file order; the "devices" member is the
+// storage service's answer and is handed on as it stands, whatever its
+// shape. Sets the last error on failure.
+bool ParseStorage(const Json::Value& doc, std::vector<Share>* shares, Json::Value* devices) {
+  const Json::Value& declared = doc.isObject() ? doc["shares"] : doc;
+  if (!doc.isObject() || !(declared.isNull() || declared.isArray())) {
     VELT_FAIL(VLIBC_ERR_BAD_CONFIG);
     return false;
   }
@@ -87,6 +102,40 @@ bool LoadStorage(std::vector<Share>* shares, Json::Value* devices) {
     *devices = doc.isMember("devices") ? doc["devices"] : Json::Value(Json::arrayValue);
   }
   return true;
+}
+
+bool LoadStorage(std::vector<Share>* shares, Json::Value* devices) {
+  Json::Value doc;
+  return ReadStorage(&doc) && ParseStorage(doc, shares, devices);
+}
+
+// The system-log event of an ejected device (docs/platform.md).
+constexpr unsigned int kEventShareEjected = 0x11A00101;
+
+// Marks the share unmounted in file; the caller holds the file's lock.
+// Every other member of the document is written back as it was read.
+bool MarkEjected(const std::string& file, const std::string& name) {
+  Json::Value doc;
+  std::vector<Share> shares;
+  if (!ReadStorage(&doc) || !ParseStorage(doc, &shares, nullptr)) return false;
+  // The first share of the name, as VELTShareInfoGet finds it.
+  Json::ArrayIndex index = 0;
+  while (index < shares.size() && shares[index].name != name) ++index;
+  if (index == shares.size()) {
+    VELT_FAIL(VLIBC_ERR_NOT_FOUND);
+    return false;
+  }
+  if (!shares[index].mounted) {
+    VELT_FAIL(VLIBC_ERR_NOT_MOUNTED);
+    return false;
+  }
+  doc["shares"][index]["mounted"] = false;
+  Json::StreamWriterBuilder writer;
+  writer["indentation"] = "  ";
+  writer["emitUTF8"] = true;
+  struct stat old {};
+  const bool exists = stat(file.c_str(), &old) == 0;
+  return velt_dev::ReplaceFile(file, Json::writeString(writer, doc) + "\n", exists ? &old : nullptr);
 }
 
 bool CopyOut(const std::string& value, char* out, size_t size) {
@@ -207,6 +256,46 @@ int VELTDevFsUuidGet(const char* devPath, char* uuid, size_t size) {
   }
   blkid_free_probe(probe);
   return result;
+}
+
+// The development form of an eject: the share is marked unmounted in
+// storage.json and the event goes to the system log.
+int VELTShareEject(const char* name) {
+  if (VELT_FAULT_HIT()) return -1;
+  if (!name || name[0] == '\0') {
+    VELT_FAIL(VLIBC_ERR_BAD_PARAMETER);
+    return -1;
+  }
+  const std::string file = velt_dev::StateDir() + "/storage.json";
+  // Each eject rewrites the whole file: two at once without the lock would
+  // each write back the other's share as still mounted.
+  const int lock = open((file + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+  if (lock < 0) {
+    // Without the state folder nothing is declared, so no share is known.
+    VELT_FAIL(errno == ENOENT ? VLIBC_ERR_NOT_FOUND : VLIBC_ERR_IO);
+    return -1;
+  }
+  int locked;
+  do {
+    locked = flock(lock, LOCK_EX);
+  } while (locked != 0 && errno == EINTR);
+  bool ok = locked == 0;
+  if (!ok) VELT_FAIL(VLIBC_ERR_IO);
+  ok = ok && MarkEjected(file, name);
+  if (ok) {
+    // The device is gone whether or not the event can be logged; a failed
+    // log line must not turn the eject into a failure or touch the caller's
+    // last error.
+    const int code = velt_dev::LastErrorCode();
+    const char* source = velt_dev::LastErrorFile();
+    const int line = velt_dev::LastErrorLine();
+    if (VELTLogSet1(VELT_LOG_CATEGORY_SYSTEM, VELT_LOG_LEVEL_INFO, kEventShareEjected, "Storage", name,
+                    "ejected", nullptr) != 0) {
+      velt_dev::SetLastError(code, source, line);
+    }
+  }
+  close(lock);
+  return ok ? 0 : -1;
 }
 
 }  // extern "C"

@@ -1,8 +1,9 @@
 /*
  * Platform shares and the devices behind them: a share's mount state and
- * mount point, the block device behind a mounted path, and a device's
- * file-system identity. Every call may be made from several threads;
- * failures set the platform's last error (vlibc.h).
+ * mount point, the block device behind a mounted path, a device's
+ * file-system identity, and ejecting a share's device. Every call may be
+ * made from several threads; failures set the platform's last error
+ * (vlibc.h).
  */
 #ifndef VELT_SHARE_H
 #define VELT_SHARE_H
@@ -45,6 +46,15 @@ VELT_API int VELTDevFsUuidGet(const char* devPath, char* uuid, size_t size);
  * Returns 0; negative with VLIBC_ERR_BAD_PARAMETER for a null or empty
  * volume path or a result that does not fit. */
 VELT_API int VELTShareBinPathGet(const char* volPath, char* binPath, size_t size);
+
+/* Ejects the removable device behind the share named name, as a NAS does
+ * after a task set to eject its device: the share is unmounted and the
+ * event logged. Returns 0; negative with VLIBC_ERR_NOT_FOUND for an unknown
+ * name, VLIBC_ERR_NOT_MOUNTED for a share that is not mounted,
+ * VLIBC_ERR_BAD_PARAMETER for a null or empty name, VLIBC_ERR_BAD_CONFIG
+ * when the platform's share list cannot be read and VLIBC_ERR_IO when it
+ * cannot be written. */
+VELT_API int VELTShareEject(const char* name);
 
 #ifdef __cplusplus
 }
