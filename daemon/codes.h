@@ -9,10 +9,13 @@ namespace plovod {
 enum Code {
   kOk = 0,
   kUnknownAction = 1,
-  kBadRequest = 2,    // a missing or malformed argument, an unsafe path, a refused timetable
+  // A missing or malformed argument, an unsafe path, or a timetable the
+  // scheduler did not take (the scheduler does not tell a bad timetable
+  // from its own failure).
+  kBadRequest = 2,
   kConflict = 3,      // the task name is taken, or the task is running
   kNoSuchTask = 4,
-  kFailed = 5,        // the task database, the task folder or the scheduler failed
+  kFailed = 5,        // the task database or folder failed, or an entry could not be renamed or removed
   kNotRunning = 8,    // cancel of a task that is not running
   kDeviceAbsent = 9,  // the task's device is not plugged in
   kShareAbsent = 10,  // the task's NAS share is missing or not mounted

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <ctime>
+#include <set>
 
 #include "common/log.h"
 #include "daemon/devices.h"
@@ -220,7 +221,7 @@ void Daemon::Shutdown() {
   store_.Close();
 }
 
-PObject Daemon::Describe(const StoredTask& task, const std::vector<PluggedDevice>& plugged) {
+PObject Daemon::Describe(const StoredTask& task, const std::vector<PluggedDevice>& plugged, bool running) {
   const TaskDB::TaskInfo& info = task.info;
   PluggedDevice device;
   for (const PluggedDevice& candidate : plugged) {
@@ -228,7 +229,6 @@ PObject Daemon::Describe(const StoredTask& task, const std::vector<PluggedDevice
   }
   const bool usbMounted = !device.share_name.empty();
   const bool nasMounted = !MountedSharePath(info.nas_share_name).empty();
-  const bool running = runner_.IsRunning(info.id);
 
   PObject t;
   t["id"] = info.id;
@@ -263,12 +263,16 @@ PObject Daemon::Describe(const StoredTask& task, const std::vector<PluggedDevice
 }
 
 PObject Daemon::ListTask(const PObject&) {
+  // Which tasks run is read before their rows: a run records its outcome
+  // before it counts as ended, so an idle task's row is never the one from
+  // before its last run.
+  const std::set<unsigned long> running = runner_.Running();
   std::vector<StoredTask> tasks;
   if (Code failed = store_.List(tasks)) return Error(failed);
   PObject answer = Ok();
   PObject::array_type& list = answer["task_list"].asArray();
   const std::vector<PluggedDevice> plugged = ListPluggedDevices();
-  for (const StoredTask& task : tasks) list.push_back(Describe(task, plugged));
+  for (const StoredTask& task : tasks) list.push_back(Describe(task, plugged, running.count(task.info.id) != 0));
   return answer;
 }
 
@@ -276,10 +280,11 @@ PObject Daemon::GetTaskSetting(const PObject& request) {
   Args args(request);
   const unsigned long id = args.TaskId();
   if (!args.Ok()) return BadRequest(args);
+  const bool running = runner_.IsRunning(id);  // before the row, as in ListTask
   StoredTask task;
   if (Code failed = store_.Get(id, task)) return Error(failed);
   PObject answer = Ok();
-  const PObject described = Describe(task, ListPluggedDevices());
+  const PObject described = Describe(task, ListPluggedDevices(), running);
   for (const auto& [key, value] : described.asMap()) answer[key] = value;
   return answer;
 }

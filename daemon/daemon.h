@@ -66,7 +66,8 @@ class Daemon {
   PObject Stop(const PObject& request);
 
   // The task map the module reads, for the task as stored and as it runs.
-  PObject Describe(const StoredTask& task, const std::vector<PluggedDevice>& plugged);
+  // running says whether the task ran when its row was read.
+  PObject Describe(const StoredTask& task, const std::vector<PluggedDevice>& plugged, bool running);
   // Starts a run of the task; kOk or why not.
   Code StartRun(const StoredTask& task, std::string& why);
   // Called on a run's thread when it ends.

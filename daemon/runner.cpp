@@ -81,6 +81,15 @@ bool Runner::IsRunning(unsigned long id) const {
   return it != runs_.end() && !it->second->done;
 }
 
+std::set<unsigned long> Runner::Running() const {
+  std::lock_guard<std::mutex> lock(mutex_);
+  std::set<unsigned long> ids;
+  for (const auto& [id, run] : runs_) {
+    if (!run->done) ids.insert(id);
+  }
+  return ids;
+}
+
 std::string Runner::Copying(unsigned long id) const {
   std::lock_guard<std::mutex> lock(mutex_);
   auto it = runs_.find(id);

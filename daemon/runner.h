@@ -10,6 +10,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <set>
 #include <string>
 #include <thread>
 
@@ -60,6 +61,8 @@ class Runner {
   // Cancels the runs that copy from or to the device shared as share.
   void CancelOnShare(const std::string& share);
   bool IsRunning(unsigned long id) const;
+  // The tasks that run now.
+  std::set<unsigned long> Running() const;
   // The file a run copies now; "" when none or the task does not run.
   std::string Copying(unsigned long id) const;
   // Cancels every run, waits for them, and refuses new ones from then on.

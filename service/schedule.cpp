@@ -3,6 +3,8 @@
 #include <json/json.h>
 #include <velt/sched.h>
 
+#include <algorithm>
+#include <iterator>
 #include <memory>
 #include <utility>
 
@@ -156,19 +158,22 @@ bool CreateSchedule(unsigned long taskId, int taskType, const std::string& name,
   PVELTSCHEDTASK t = task.get();
   // The entry belongs to root and to the package: the user may run it but
   // neither rename it, give it away nor delete it.
-  int failed = (VELTSchedCTaskSetApp(t, kScheduleApp) < 0) |
-               (VELTSchedCTaskSetAppName(t, "#common:app_name#") < 0) |
-               (VELTSchedCTaskSetName(t, name.c_str()) < 0) |
-               (VELTSchedCTaskSetAction(t, IconKey(taskType)) < 0) |
-               (VELTSchedCTaskSetCommand(t, command.c_str()) < 0) |
-               (VELTSchedCTaskSetState(t, enabled ? 1 : 0) < 0) |
-               (VELTSchedCTaskSetCanRunAppSameTime(t, 1) < 0) |
-               (VELTSchedCTaskSetCanRunTaskSameTime(t, 1) < 0) |
-               (VELTSchedCTaskSetCanRunFromUI(t, 1) < 0) |
-               (VELTSchedCTaskSetOwner(t, 0) < 0) |
-               (VELTSchedCTaskSetCanEditName(t, 0) < 0) |
-               (VELTSchedCTaskSetCanEditOwner(t, 0) < 0) |
-               (VELTSchedCTaskSetCanDeleteFromUI(t, 0) < 0);
+  const int results[] = {
+      VELTSchedCTaskSetApp(t, kScheduleApp),
+      VELTSchedCTaskSetAppName(t, "#common:app_name#"),
+      VELTSchedCTaskSetName(t, name.c_str()),
+      VELTSchedCTaskSetAction(t, IconKey(taskType)),
+      VELTSchedCTaskSetCommand(t, command.c_str()),
+      VELTSchedCTaskSetState(t, enabled ? 1 : 0),
+      VELTSchedCTaskSetCanRunAppSameTime(t, 1),
+      VELTSchedCTaskSetCanRunTaskSameTime(t, 1),
+      VELTSchedCTaskSetCanRunFromUI(t, 1),
+      VELTSchedCTaskSetOwner(t, 0),
+      VELTSchedCTaskSetCanEditName(t, 0),
+      VELTSchedCTaskSetCanEditOwner(t, 0),
+      VELTSchedCTaskSetCanDeleteFromUI(t, 0),
+  };
+  const bool failed = std::any_of(std::begin(results), std::end(results), [](int r) { return r < 0; });
   if (failed) {
     PLOVO_LIB_ERR("Failed to set the fields of the schedule of task %lu\n", taskId);
     return false;
