@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "emulation.h"
 #include "filter/file-filter.h"
 #include "log-capture.h"
 #include "sandbox.h"
@@ -130,6 +131,7 @@ TEST_F(FileFilterTest, AFailedLoadKeepsNothingAndLogs) {
 class PlovoFilterTool : public plovo_test::SandboxTest {};
 
 TEST_F(PlovoFilterTool, PrintsTestsAndExitsWithTheParseResultOrAnError) {
+  PLOVO_SKIP_UNLESS_TARGET_PROGRAMS_RUN();
   WriteFile("/black.filter", "[Common]\nblack_name = \"Secret\"\nmax_path = 3\n");
   WriteFile("/unknown.filter", "[Common]\nwhite_name = \"*\"\nfuture = 1\n");
   WriteFile("/broken.filter", "[Common]\nwhite_name = \"*\n");

@@ -6,6 +6,7 @@
 #include <map>
 #include <thread>
 
+#include "emulation.h"
 #include "log-capture.h"
 #include "service-sandbox.h"
 #include "service/repo-volume.h"
@@ -56,6 +57,7 @@ TEST_F(RepoMoveTest, SameOrEmptyTargetIsNoMove) {
 }
 
 TEST_P(RepoMoveTest, RepositoryArrivesWholeOrStaysWhole) {
+  PLOVO_SKIP_UNLESS_TARGET_PROGRAMS_RUN();
   const MoveCase& c = GetParam();
   if (c.tmpfs && mount("tmpfs", Path("/volume2").c_str(), "tmpfs", 0, "size=256k") != 0)
     GTEST_SKIP() << "cannot mount a tmpfs here: " << std::strerror(errno);

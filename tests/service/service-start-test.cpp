@@ -6,6 +6,7 @@
 #include <filesystem>
 #include <thread>
 
+#include "emulation.h"
 #include "log-capture.h"
 #include "service-sandbox.h"
 #include "service/schedule.h"
@@ -45,6 +46,7 @@ TEST_F(ServiceStartTest, DisabledPackageOrNoUsableVolumeStartsNoDaemon) {
 // a second start does nothing, and a stop and a new start hide and show the
 // scheduler entries and leave their events in the platform log.
 TEST_F(ServiceStartTest, ReuseStopAndStartAgainThroughTheHost) {
+  PLOVO_SKIP_UNLESS_TARGET_PROGRAMS_RUN();
   for (const char* bad : {"", "restart", "start stop", "--module", "--module /nonexistent status"}) EXPECT_EQ(Host(bad), 2) << bad;
   const std::string module = "--module " PLOVO_MODULE_PATH " ";
   MakeDir("/volume2/@Plovo");

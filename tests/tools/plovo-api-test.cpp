@@ -6,6 +6,7 @@
 
 #include <string>
 
+#include "emulation.h"
 #include "sandbox.h"
 
 namespace {
@@ -31,6 +32,7 @@ class PlovoApiTest : public plovo_test::SandboxTest {
 };
 
 TEST_F(PlovoApiTest, ParamsTheReaderRefusesEndWithStatusTwo) {
+  PLOVO_SKIP_UNLESS_TARGET_PROGRAMS_RUN();
   const std::string deep = std::string(2000, '[') + std::string(2000, ']');
   const struct {
     const char* name;

@@ -8,6 +8,7 @@
 #include <cstdio>
 #include <string>
 
+#include "emulation.h"
 #include "sandbox.h"
 
 namespace {
@@ -84,6 +85,7 @@ class PlovoApiTest : public plovo_test::SandboxTest {
 };
 
 TEST_F(PlovoApiTest, PrintsOneLineAndExitsByOutcome) {
+  PLOVO_SKIP_UNLESS_TARGET_PROGRAMS_RUN();
   WriteStatus(2, "");
   CommandResult r = Api("list");
   EXPECT_EQ(r.status, 1);
@@ -106,6 +108,7 @@ TEST_F(PlovoApiTest, PrintsOneLineAndExitsByOutcome) {
 }
 
 TEST_F(PlovoApiTest, UsageAndLoadingErrorsExitWithTwo) {
+  PLOVO_SKIP_UNLESS_TARGET_PROGRAMS_RUN();
   EXPECT_EQ(Api("").status, 2);
   EXPECT_EQ(Api("list '{}' extra").status, 2);
   EXPECT_EQ(Api("--module").status, 2);
