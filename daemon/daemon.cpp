@@ -1,11 +1,16 @@
 #include "daemon/daemon.h"
 
+#include <limits.h>
+#include <stdlib.h>
+
 #include <algorithm>
 #include <ctime>
 #include <set>
 
 #include "common/log.h"
 #include "daemon/devices.h"
+#include "velt/hw.h"
+#include "velt/share.h"
 
 namespace plovod {
 
@@ -16,6 +21,11 @@ namespace {
 // kBadRequest naming it, never a default value taken for its word.
 class Args {
  public:
+  static constexpr size_t kMaxName = 255;
+  static constexpr size_t kMaxPath = 4095;
+  static constexpr int kMaxVersions = 100000;
+  static constexpr size_t kMaxListMembers = 1000;
+
   explicit Args(const PObject& request) : request_(request) {}
 
   std::string Text(const char* key) {
@@ -46,7 +56,7 @@ class Args {
   // A folder of a share: "/" or "/a/b", without "." or ".." components.
   std::string Folder(const char* key) {
     const std::string path = Text(key);
-    if (path.empty() || path[0] != '/') return Bad(key), "";
+    if (path.empty() || path[0] != '/' || path.size() > kMaxPath) return Bad(key), "";
     for (size_t begin = 1; begin <= path.size();) {
       size_t end = path.find('/', begin);
       if (end == std::string::npos) end = path.size();
@@ -58,15 +68,26 @@ class Args {
   }
   std::string ShareName(const char* key) {
     const std::string name = Text(key);
-    if (name.empty() || name == "." || name == ".." || name.find('/') != std::string::npos) return Bad(key), "";
+    if (name.empty() || name == "." || name == ".." || name.find('/') != std::string::npos || name.size() > kMaxName) {
+      return Bad(key), "";
+    }
     return name;
   }
+  // A task name: what a list on a page and a scheduler entry can show.
+  std::string TaskName(const char* key) {
+    const std::string name = Text(key);
+    if (name.empty() || name.size() > kMaxName) return Bad(key), "";
+    return name;
+  }
+  // A filter list: names or extensions, each one that a file could have.
   std::vector<std::string> List(const char* key) {
     std::vector<std::string> items;
     const PObject& value = request_[key];
-    if (!value.isArray()) return Bad(key), items;
+    if (!value.isArray() || value.asArray().size() > kMaxListMembers) return Bad(key), items;
     for (const PObject& item : value.asArray()) {
-      if (!item.isString()) return Bad(key), items;
+      if (!item.isString() || item.asStringRef().empty() || item.asStringRef().size() > kMaxName) {
+        return Bad(key), items;
+      }
       items.push_back(item.asStringRef());
     }
     return items;
@@ -152,6 +173,30 @@ std::string NasPath(const TaskDB::TaskInfo& info) {
 }
 
 bool IsExport(const TaskDB::TaskInfo& info) { return info.task_type == 2; }
+
+// A folder as "/a/b", without empty components; "" for the root.
+std::string Normalized(const std::string& folder) {
+  std::string result;
+  for (size_t begin = 0; begin < folder.size();) {
+    size_t end = folder.find('/', begin);
+    if (end == std::string::npos) end = folder.size();
+    if (end > begin) result += "/" + folder.substr(begin, end - begin);
+    begin = end + 1;
+  }
+  return result;
+}
+
+// Where a share really is; "" when it is not there.
+std::string RealPath(const std::string& path) {
+  if (path.empty()) return "";
+  char resolved[PATH_MAX];
+  return realpath(path.c_str(), resolved) ? resolved : "";
+}
+
+// Whether the folder inner is outer or lies below it.
+bool Inside(const std::string& inner, const std::string& outer) {
+  return inner.compare(0, outer.size(), outer) == 0 && (inner.size() == outer.size() || inner[outer.size()] == '/');
+}
 
 // PObject integers are unsigned on the wire; a negative number travels as
 // its 64-bit two's complement and the module reads it back as signed.
@@ -313,7 +358,7 @@ PObject Daemon::AddTask(const PObject& request) {
   device.product = args.Text("product");
   TaskDB::TaskInfo info;
   info.is_enable = true;
-  info.task_name = args.Text("task_name");
+  info.task_name = args.TaskName("task_name");
   info.task_type = args.Choice("task_type", 1, 3);
   info.nas_share_name = args.ShareName("nas_share_name");
   info.usb_folder_path = args.Folder("usb_folder_path");
@@ -325,13 +370,12 @@ PObject Daemon::AddTask(const PObject& request) {
   info.remove_src_file = args.Flag("remove_src_file");
   info.conflict_policy = args.Policy("conflict_policy");
   info.enable_rotation = args.Flag("enable_rotation");
-  info.max_version_count = args.Number("max_version_count");
+  info.max_version_count = args.Choice("max_version_count", 1, Args::kMaxVersions);
   info.rotation_policy = args.Policy("rotation_policy");
   const Trigger trigger = args.Triggers();
   const Filters filters = args.Lists();
   if (!args.Ok()) return BadRequest(args);
   if (device.uuid.empty()) return Error(kBadRequest, "invalid uuid");
-  if (info.task_name.empty()) return Error(kBadRequest, "invalid task_name");
   if (Code failed = store_.Add(device, info, trigger, filters)) {
     return Error(failed, failed == kConflict ? "the task name is taken" : "");
   }
@@ -348,7 +392,7 @@ PObject Daemon::SetTaskSetting(const PObject& request) {
   if (Code failed = store_.Get(id, task)) return Error(failed);
   TaskDB::TaskInfo& info = task.info;
   info.task_type = args.Choice("task_type", 1, 3);
-  info.task_name = args.Text("task_name");
+  info.task_name = args.TaskName("task_name");
   info.usb_folder_path = args.Folder("usb_folder_path");
   info.nas_folder_path = args.Folder("nas_folder_path");
   info.nas_share_name = args.ShareName("nas_share_name");
@@ -358,9 +402,8 @@ PObject Daemon::SetTaskSetting(const PObject& request) {
              renamed = args.Flag("rename_photo_video"), remove = args.Flag("remove_src_file"),
              rotate = args.Flag("enable_rotation");
   const int conflict = args.Policy("conflict_policy"), rotation = args.Policy("rotation_policy");
-  const uint64_t versions = args.Number("max_version_count");
+  const uint64_t versions = args.Choice("max_version_count", 1, Args::kMaxVersions);
   if (!args.Ok()) return BadRequest(args);
-  if (info.task_name.empty()) return Error(kBadRequest, "invalid task_name");
   if (info.copy_strategy == 3) {
     info.keep_dir_structure = keep;
     info.smart_create_date_dir = dated;
@@ -397,9 +440,7 @@ PObject Daemon::SetFilterSetting(const PObject& request) {
   const unsigned long id = args.TaskId();
   const Filters filters = args.Lists();
   if (!args.Ok()) return BadRequest(args);
-  if (Code failed = store_.SetFilters(id, filters)) {
-    return Error(failed, failed == kBadRequest ? "an empty or overlong list member" : "");
-  }
+  if (Code failed = store_.SetFilters(id, filters)) return Error(failed);
   return Ok();
 }
 
@@ -428,19 +469,30 @@ Code Daemon::StartRun(const StoredTask& task, std::string& why) {
   }
   PluggedDevice device;
   if (!FindPluggedDevice(task.device.uuid, device)) return kDeviceAbsent;
-  const std::string share = MountedSharePath(info.nas_share_name);
+  const std::string share = RealPath(MountedSharePath(info.nas_share_name));
   if (share.empty()) return kShareAbsent;
+  const std::string card = RealPath(device.share_path);
+  if (card.empty()) return kDeviceAbsent;
+  const std::string usb = Under(card, Normalized(info.usb_folder_path));
+  const std::string nas = Under(share, Normalized(info.nas_folder_path));
+  // A copy into its own source would copy its copies, without end.
+  if (Inside(usb, nas) || Inside(nas, usb)) {
+    why = "the source and the destination overlap";
+    return kBadRequest;
+  }
   RunPlan plan;
   plan.id = info.id;
-  const std::string usb = Under(device.share_path, info.usb_folder_path);
-  const std::string nas = Under(share, info.nas_folder_path);
+  plan.source_root = IsExport(info) ? share : card;
   plan.source = IsExport(info) ? nas : usb;
+  plan.destination_root = IsExport(info) ? card : share;
   plan.destination = IsExport(info) ? usb : nas;
   plan.device_share = device.share_name;
+  plan.eject = task.device.eject_when_task_done;
   if (!runner_.Start(plan)) {
     why = "the task is running";
     return kConflict;
   }
+  if (beep_) VELTBuzzerBeep(VELT_BEEP_SHORT);
   return kOk;
 }
 
@@ -458,6 +510,12 @@ PObject Daemon::RunTask(const PObject& request) {
 void Daemon::RunFinished(const RunPlan& plan, int error) {
   store_.RecordRun(plan.id, error, error == 0 ? static_cast<unsigned int>(std::time(nullptr)) : 0);
   PLOVO_LOG(error == 0 ? LOG_INFO : LOG_WARNING, "run of task %lu ended: %d", plan.id, error);
+  if (beep_) VELTBuzzerBeep(VELT_BEEP_LONG);
+  // Only once nothing else copies from or to the device.
+  if (error == 0 && plan.eject && !runner_.BusyOnShare(plan.device_share, plan.id) &&
+      VELTShareEject(plan.device_share.c_str()) != 0) {
+    PLOVO_LOG(LOG_WARNING, "cannot eject the device of share %s", plan.device_share.c_str());
+  }
 }
 
 PObject Daemon::CancelTask(const PObject& request) {

@@ -12,7 +12,7 @@
 // serves "/tmp/plovo-socket" and writes the running state (4) when it
 // serves. A "stop" command, SIGTERM or SIGINT end it: its runs are
 // cancelled and waited for, the task database is closed, the socket and
-// the pid file are removed, and it exits 0.
+// the pid file are removed, the state becomes stopped (6), and it exits 0.
 #include <signal.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -33,7 +33,8 @@
 
 namespace {
 
-// Where the log goes: stderr in the foreground; in the background the
+// Where the log goes, from the first line on (a refused start says why):
+// stderr in the foreground; in the background the
 // system log, or, in a sandbox, "<root>/var/log/plovod.log", so that a
 // development daemon's lines are found beside its files.
 void ChooseLogSink(bool foreground) {
@@ -83,8 +84,7 @@ int main(int argc, char** argv) {
   if (!plovod::TakePidFile(pidFile, pidLock)) return 1;
   auto fail = [&](const char* why) {
     PLOVO_LOG(LOG_ERR, "%s", why);
-    std::fprintf(stderr, "plovod: %s\n", why);
-    unlink(pidFile.c_str());
+    plovod::ReleasePidFile(pidFile, pidLock);
     return 1;
   };
 
@@ -110,7 +110,12 @@ int main(int argc, char** argv) {
   PLOVO_LOG(LOG_INFO, "stopping");
   server.Stop();
   daemon.Shutdown();
-  unlink(pidFile.c_str());
+  // Also when nobody asked the service control to stop it, the state must
+  // not go on saying that the daemon serves.
+  ServiceStatus stopped;
+  stopped.state = PLOVO_SERVICE_STATUS_STOP;
+  if (SetServiceStatus(stopped) != 0) PLOVO_LOG(LOG_ERR, "cannot write the stopped state");
+  plovod::ReleasePidFile(pidFile, pidLock);
   PLOVO_LOG(LOG_INFO, "stopped");
   return 0;
 }

@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/file.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -9,26 +10,51 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "common/log.h"
+
 namespace plovod {
 
+namespace {
+
+// Whether path still names the open file fd: a pid file removed or
+// replaced after it was opened is no longer the one others look at.
+bool StillNamed(const std::string& path, int fd) {
+  struct stat named {}, open {};
+  return stat(path.c_str(), &named) == 0 && fstat(fd, &open) == 0 && named.st_dev == open.st_dev &&
+         named.st_ino == open.st_ino;
+}
+
+}  // namespace
+
 bool TakePidFile(const std::string& path, Plovo::UniqueFd& held) {
-  Plovo::UniqueFd fd(open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0644));
-  if (fd.get() < 0) {
-    std::fprintf(stderr, "plovod: cannot open %s: %s\n", path.c_str(), std::strerror(errno));
-    return false;
+  for (int attempt = 0; attempt < 3; ++attempt) {
+    Plovo::UniqueFd fd(open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0644));
+    if (fd.get() < 0) {
+      PLOVO_LOG(LOG_ERR, "cannot open %s: %s", path.c_str(), std::strerror(errno));
+      return false;
+    }
+    if (flock(fd.get(), LOCK_EX | LOCK_NB) != 0) {
+      PLOVO_LOG(LOG_ERR, "another plovod runs (%s is locked)", path.c_str());
+      return false;
+    }
+    // Removed by the daemon that held it as it went: take the new one.
+    if (!StillNamed(path, fd.get())) continue;
+    const std::string pid = std::to_string(getpid()) + "\n";
+    if (ftruncate(fd.get(), 0) != 0 ||
+        write(fd.get(), pid.data(), pid.size()) != static_cast<ssize_t>(pid.size())) {
+      PLOVO_LOG(LOG_ERR, "cannot write %s: %s", path.c_str(), std::strerror(errno));
+      return false;
+    }
+    held = std::move(fd);
+    return true;
   }
-  if (flock(fd.get(), LOCK_EX | LOCK_NB) != 0) {
-    std::fprintf(stderr, "plovod: another plovod runs (%s is locked)\n", path.c_str());
-    return false;
-  }
-  const std::string pid = std::to_string(getpid()) + "\n";
-  if (ftruncate(fd.get(), 0) != 0 ||
-      write(fd.get(), pid.data(), pid.size()) != static_cast<ssize_t>(pid.size())) {
-    std::fprintf(stderr, "plovod: cannot write %s: %s\n", path.c_str(), std::strerror(errno));
-    return false;
-  }
-  held = std::move(fd);
-  return true;
+  PLOVO_LOG(LOG_ERR, "%s keeps changing", path.c_str());
+  return false;
+}
+
+void ReleasePidFile(const std::string& path, Plovo::UniqueFd& held) {
+  if (held.get() >= 0 && StillNamed(path, held.get())) unlink(path.c_str());
+  held.reset();
 }
 
 void Daemonize(int* ready) {

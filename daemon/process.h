@@ -13,9 +13,12 @@ namespace plovod {
 // Takes the pid file at path under an exclusive flock and writes this
 // process's id into it. The lock lasts as long as held stays open, which
 // is how the service control and a second daemon tell that this one runs.
-// False, with a line on stderr, when another process holds the file or it
+// False, with a line in the log, when another process holds the file or it
 // cannot be written; the file is then left as it was.
 bool TakePidFile(const std::string& path, Plovo::UniqueFd& held);
+
+// Removes the pid file, if it is still the one held, and lets go of it.
+void ReleasePidFile(const std::string& path, Plovo::UniqueFd& held);
 
 // Puts the process in the background. The starting process waits here and
 // exits 0 once the daemon reports that it serves (ReportReady), or 1 when

@@ -19,9 +19,12 @@ namespace plovod {
 // What one run does, fixed when it starts.
 struct RunPlan {
   unsigned long id = 0;
-  std::string source;        // the folder copied from
-  std::string destination;   // the folder copied into
+  std::string source_root;       // the share the source lies in
+  std::string source;            // the folder copied from, below source_root
+  std::string destination_root;  // the share the destination lies in
+  std::string destination;       // the folder copied into, below destination_root
   std::string device_share;  // the device's share: pulling it out cancels the run
+  bool eject = false;        // eject the device after a run that succeeded
 };
 
 // A run as its job sees it. Thread-safe.
@@ -61,6 +64,9 @@ class Runner {
   // Cancels the runs that copy from or to the device shared as share.
   void CancelOnShare(const std::string& share);
   bool IsRunning(unsigned long id) const;
+  // Whether a run other than task except's copies from or to the device
+  // shared as share.
+  bool BusyOnShare(const std::string& share, unsigned long except) const;
   // The tasks that run now.
   std::set<unsigned long> Running() const;
   // The file a run copies now; "" when none or the task does not run.
@@ -86,11 +92,12 @@ class Runner {
 };
 
 // The job of a run until the copy engine takes over: every regular file of
-// the source tree that the destination does not hold with the same size
-// and modification time is copied, through a temporary name in its
-// destination folder, synced, and renamed into place. Links, other special
-// files and the platform's "@eaDir" folders are left out; nothing is ever
-// removed.
+// the source tree whose name the destination does not hold yet is copied,
+// through a temporary name in its destination folder, synced, and put in
+// place. Both trees are walked below their shares without following a
+// link. Links, other special files, the platform's "@eaDir" folders and
+// the temporary files of a run that was killed are left out; nothing at
+// the destination is ever replaced or removed.
 int CopyNewFiles(const RunPlan& plan, RunControl& control);
 
 }  // namespace plovod

@@ -135,7 +135,7 @@ Code TaskStore::Add(const TaskDB::USBInfo& device, TaskDB::TaskInfo& info, const
   }
   if (Code failed = WriteFilters(dir, filters)) return undo(failed);
   long scheduleId = -1;
-  if (Code failed = ApplyTimetable(info, trigger, scheduleId)) return undo(failed);
+  if (Code failed = CreateEntry(info, trigger, scheduleId)) return undo(failed);
   if (scheduleId != -1) {
     info.schedule_id = scheduleId;
     if (db_.UpdateTaskInfo(info) != 0) {
@@ -151,56 +151,83 @@ Code TaskStore::Add(const TaskDB::USBInfo& device, TaskDB::TaskInfo& info, const
 }
 
 Code TaskStore::Update(const TaskDB::TaskInfo& info) {
+  std::lock_guard<std::mutex> lock(rowMutex_);
   StoredTask old;
   if (Code missing = Get(info.id, old)) return missing;
   if (Code taken = NameTaken(info.task_name, info.id)) return taken;
-  const bool renamed = info.schedule_id != -1 && info.task_name != old.info.task_name;
-  if (renamed && !Plovo::UpdateScheduleName(info.schedule_id, info.task_name)) return kFailed;
-  if (db_.UpdateTaskInfo(info) != 0) {
-    if (renamed) Plovo::UpdateScheduleName(info.schedule_id, old.info.task_name);
+  // The settings are the caller's; what runs, triggers and enable wrote
+  // meanwhile is kept.
+  TaskDB::TaskInfo row = info;
+  row.usb_id = old.info.usb_id;
+  row.is_enable = old.info.is_enable;
+  row.schedule_id = old.info.schedule_id;
+  row.last_copied_time = old.info.last_copied_time;
+  row.error = old.info.error;
+  const bool renamed = row.schedule_id != -1 && row.task_name != old.info.task_name;
+  if (renamed && !Plovo::UpdateScheduleName(row.schedule_id, row.task_name)) return kFailed;
+  if (db_.UpdateTaskInfo(row) != 0) {
+    if (renamed) Plovo::UpdateScheduleName(row.schedule_id, old.info.task_name);
     return kFailed;
   }
   return kOk;
 }
 
-Code TaskStore::ApplyTimetable(const TaskDB::TaskInfo& info, const Trigger& trigger, long& scheduleId) {
+Code TaskStore::CreateEntry(const TaskDB::TaskInfo& info, const Trigger& trigger, long& scheduleId) {
   bool present = false;
   if (!ParseTimetable(trigger.schedule_json, present)) return kBadRequest;
-  scheduleId = info.schedule_id;
-  if (!present) {
-    if (scheduleId != -1 && !Plovo::RemoveSchedule(scheduleId)) return kFailed;
-    scheduleId = -1;
-    return kOk;
+  scheduleId = -1;
+  if (!present) return kOk;
+  int64_t created = -1;
+  if (!Plovo::CreateSchedule(info.id, info.task_type, info.task_name, trigger.schedule_enabled,
+                             trigger.schedule_json, created)) {
+    return kBadRequest;
   }
-  if (scheduleId == -1) {
-    int64_t created = -1;
-    if (!Plovo::CreateSchedule(info.id, info.task_type, info.task_name, trigger.schedule_enabled,
-                               trigger.schedule_json, created)) {
-      return kBadRequest;
-    }
-    scheduleId = created;
-    return kOk;
-  }
-  return Plovo::UpdateScheduleContent(scheduleId, trigger.schedule_enabled, trigger.schedule_json)
-             ? kOk
-             : kBadRequest;
+  scheduleId = created;
+  return kOk;
 }
 
 Code TaskStore::SetTrigger(unsigned long id, const Trigger& trigger, long& scheduleId) {
+  std::lock_guard<std::mutex> lock(rowMutex_);
   StoredTask task;
   if (Code missing = Get(id, task)) return missing;
-  if (Code failed = ApplyTimetable(task.info, trigger, scheduleId)) return failed;
-  const bool created = task.info.schedule_id == -1 && scheduleId != -1;
-  if (scheduleId != task.info.schedule_id) {
-    task.info.schedule_id = scheduleId;
-    if (db_.UpdateTaskInfo(task.info) != 0) {
-      if (created) Plovo::RemoveSchedule(scheduleId);
-      return kFailed;
-    }
-  }
+  bool present = false;
+  if (!ParseTimetable(trigger.schedule_json, present)) return kBadRequest;
+  // The device's settings first: they are put back when the entry or the
+  // row cannot follow, so that the three never disagree.
+  const TaskDB::USBInfo oldDevice = task.device;
   task.device.run_when_plug_in = trigger.run_when_plug_in;
   task.device.eject_when_task_done = trigger.eject_when_task_done;
-  return db_.UpdateUSBInfo(task.device) == 0 ? kOk : kFailed;
+  if (db_.UpdateUSBInfo(task.device) != 0) return kFailed;
+  auto undo = [&](Code code) {
+    db_.UpdateUSBInfo(oldDevice);
+    return code;
+  };
+  const long old = task.info.schedule_id;
+  scheduleId = old;
+  if (present && old != -1) {
+    return Plovo::UpdateScheduleContent(old, trigger.schedule_enabled, trigger.schedule_json) ? kOk
+                                                                                              : undo(kBadRequest);
+  }
+  if (present) {
+    if (Code refused = CreateEntry(task.info, trigger, scheduleId)) return undo(refused);
+    task.info.schedule_id = scheduleId;
+    if (db_.UpdateTaskInfo(task.info) != 0) {
+      Plovo::RemoveSchedule(scheduleId);
+      return undo(kFailed);
+    }
+    return kOk;
+  }
+  if (old == -1) return kOk;
+  // No timetable any more: the row lets go of the entry before it goes, and
+  // takes it back if it cannot go.
+  task.info.schedule_id = scheduleId = -1;
+  if (db_.UpdateTaskInfo(task.info) != 0) return undo(kFailed);
+  if (!Plovo::RemoveSchedule(old)) {
+    task.info.schedule_id = scheduleId = old;
+    db_.UpdateTaskInfo(task.info);
+    return undo(kFailed);
+  }
+  return kOk;
 }
 
 Code TaskStore::WriteFilters(const std::string& dir, const Filters& filters) {
@@ -209,12 +236,12 @@ Code TaskStore::WriteFilters(const std::string& dir, const Filters& filters) {
   config["user_defined_extensions"] = JsonList(filters.custom_ext);
   const std::string white = dir + "/" + kWhiteList, black = dir + "/" + kBlackList,
                     user = dir + "/" + kUserConfig;
+  // The members were checked when the request was read: what fails here
+  // is the disk.
   Code result = kOk;
   if (WriteWhiteList(white + kNew, filters.white_name, filters.white_ext) != 0 ||
-      WriteBlackList(black + kNew, filters.black_name, filters.black_ext) != 0) {
-    // An empty or overlong member is the request's fault, not the disk's.
-    result = kBadRequest;
-  } else if (!WriteText(user + kNew, Json::FastWriter().write(config))) {
+      WriteBlackList(black + kNew, filters.black_name, filters.black_ext) != 0 ||
+      !WriteText(user + kNew, Json::FastWriter().write(config))) {
     result = kFailed;
   } else {
     for (const std::string& path : {white, black, user}) {
@@ -272,6 +299,7 @@ Code TaskStore::Remove(unsigned long id) {
 }
 
 void TaskStore::RecordRun(unsigned long id, int error, unsigned int finishTime) {
+  std::lock_guard<std::mutex> lock(rowMutex_);
   if (db_.UpdateTaskInfo(id, error, finishTime) != 0) PLOVO_LOG(LOG_ERR, "cannot record the run of task %lu", id);
 }
 

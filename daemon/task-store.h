@@ -10,10 +10,12 @@
 // task row keeps the entry's id.
 //
 // Results are the daemon's codes (codes.h). Not thread-safe: the daemon
-// calls it under its command lock. RecordRun may be called beside it.
+// calls it under its command lock. RecordRun may be called beside it, from
+// the runs' threads.
 #ifndef PLOVO_DAEMON_TASK_STORE_H
 #define PLOVO_DAEMON_TASK_STORE_H
 
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -57,8 +59,9 @@ class TaskStore {
   // known takes device's names and trigger's plug-in and eject settings.
   Code Add(const TaskDB::USBInfo& device, TaskDB::TaskInfo& info, const Trigger& trigger,
            const Filters& filters);
-  // Rewrites the task's row from info (its id names it) and renames its
-  // scheduler entry with it.
+  // Rewrites the task's settings from info (its id names it) and renames
+  // its scheduler entry with it; its enable state, entry and last run are
+  // kept as stored.
   Code Update(const TaskDB::TaskInfo& info);
   // Creates, changes or (for "{}") removes the task's scheduler entry and
   // sets its device's plug-in and eject settings; scheduleId receives the
@@ -76,11 +79,14 @@ class TaskStore {
  private:
   Code NameTaken(const std::string& name, unsigned long except);
   Code WriteFilters(const std::string& dir, const Filters& filters);
-  // The entry for trigger's timetable: created, updated or removed.
-  Code ApplyTimetable(const TaskDB::TaskInfo& info, const Trigger& trigger, long& scheduleId);
+  // A new entry for trigger's timetable; scheduleId -1 when it has none.
+  Code CreateEntry(const TaskDB::TaskInfo& info, const Trigger& trigger, long& scheduleId);
 
   std::string repo_;
   TaskDB db_;
+  // Held where a task's row is read and written back whole, and by
+  // RecordRun, so that neither undoes the other.
+  std::mutex rowMutex_;
 };
 
 }  // namespace plovod
