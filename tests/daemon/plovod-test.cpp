@@ -9,6 +9,7 @@
 #include <cstring>
 
 #include "daemon-sandbox.h"
+#include "emulation.h"
 #include "ipc/command-server.h"
 #include "ipc/error-code.h"
 
@@ -33,6 +34,10 @@ long Number(const std::string& json, const std::string& key) {
 
 class PlovodTest : public plovo_test::DaemonSandboxTest {
  protected:
+  void SetUp() override {
+    DaemonSandboxTest::SetUp();
+    PLOVO_SKIP_UNLESS_TARGET_PROGRAMS_RUN();
+  }
   bool Serving() const { return ReadFile("/var/packages/Plovo/etc/status") == "state=\"4\"\nerror=\"\"\n"; }
   bool Answers() { return Ok(Action("list_task")); }
   bool Gone() const { return !Exists(kSocket) && !Exists(kPidFile); }

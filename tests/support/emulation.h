@@ -1,7 +1,7 @@
 // The cross build runs its suites under qemu's user-mode emulator and says
 // so in PLOVO_EMULATOR (cmake/aarch64-linux-gnu.cmake). A test program
 // emulated that way can start host programs (/bin/sh, nm), but a program of
-// the build (plovod-dev, plovo-api, ...) only when the kernel hands aarch64
+// the build (plovod, plovo-api, ...) only when the kernel hands aarch64
 // executables to the emulator through a binfmt_misc handler; without one the
 // exec fails with "Exec format error". The tests that start such a program
 // skip themselves then, with this reason.

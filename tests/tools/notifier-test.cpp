@@ -5,6 +5,7 @@
 #include <string>
 #include <vector>
 
+#include "emulation.h"
 #include "sandbox.h"
 #include "test-daemon.h"
 
@@ -15,6 +16,10 @@ const size_t npos = std::string::npos;
 
 class NotifierTest : public plovo_test::SandboxTest {
  protected:
+  void SetUp() override {
+    SandboxTest::SetUp();
+    PLOVO_SKIP_UNLESS_TARGET_PROGRAMS_RUN();
+  }
   // Runs the notifier: its exit status, its stderr in err_; stdout stays empty.
   int Run(const std::vector<std::string>& args) {
     std::string command = "'" PLOVO_NOTIFIER_PATH "'";
