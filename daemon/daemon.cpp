@@ -444,21 +444,17 @@ PObject Daemon::SetFilterSetting(const PObject& request) {
   return Ok();
 }
 
-PObject Daemon::EnableTask(const PObject& request) {
+PObject Daemon::SetEnabled(const PObject& request, bool enable) {
   Args args(request);
   const unsigned long id = args.TaskId();
   if (!args.Ok()) return BadRequest(args);
-  if (Code failed = store_.Enable(id, true)) return Error(failed);
+  if (Code failed = store_.Enable(id, enable)) return Error(failed);
   return Ok();
 }
 
-PObject Daemon::DisableTask(const PObject& request) {
-  Args args(request);
-  const unsigned long id = args.TaskId();
-  if (!args.Ok()) return BadRequest(args);
-  if (Code failed = store_.Enable(id, false)) return Error(failed);
-  return Ok();
-}
+PObject Daemon::EnableTask(const PObject& request) { return SetEnabled(request, true); }
+
+PObject Daemon::DisableTask(const PObject& request) { return SetEnabled(request, false); }
 
 Code Daemon::StartRun(const StoredTask& task, std::string& why) {
   const TaskDB::TaskInfo& info = task.info;

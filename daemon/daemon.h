@@ -56,6 +56,7 @@ class Daemon {
   PObject SetFilterSetting(const PObject& request);
   PObject EnableTask(const PObject& request);
   PObject DisableTask(const PObject& request);
+  PObject SetEnabled(const PObject& request, bool enable);
   PObject RunTask(const PObject& request);
   PObject CancelTask(const PObject& request);
   PObject RemoveTask(const PObject& request);

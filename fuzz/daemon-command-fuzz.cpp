@@ -15,6 +15,7 @@
 #include <fstream>
 #include <string>
 
+#include "fuzz-socket.h"
 #include "common/log.h"
 #include "daemon/daemon.h"
 #include "ipc/command-server.h"
@@ -81,22 +82,11 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-  int fds[2];
-  if (socketpair(AF_UNIX, SOCK_STREAM, 0, fds) != 0) abort();
-  int buffer = 1 << 20;  // the whole input fits, so one thread can write it all first
-  setsockopt(fds[1], SOL_SOCKET, SO_SNDBUF, &buffer, sizeof(buffer));
-  setsockopt(fds[0], SOL_SOCKET, SO_RCVBUF, &buffer, sizeof(buffer));
-  size_t written = 0;
-  while (written < size) {
-    ssize_t n = send(fds[1], data + written, size - written, MSG_DONTWAIT | MSG_NOSIGNAL);
-    if (n <= 0) break;  // what does not fit is simply not part of this input
-    written += static_cast<size_t>(n);
-  }
-  close(fds[1]);
+  const int input = InputSocket(data, size);
 
   PObject request;
   {
-    CommandServer::Connection connection(fds[0]);  // owns fds[0] from here
+    CommandServer::Connection connection(input);  // owns input from here
     if (connection.Recv(request) != 0) return 0;   // the server drops such a connection
   }
   const PObject answer = gDaemon->Handle(request);

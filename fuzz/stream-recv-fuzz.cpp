@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <string>
 
+#include "fuzz-socket.h"
 #include "common/log.h"
 #include "ipc/channel.h"
 #include "ipc/pobject.h"
@@ -50,23 +51,12 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-  int fds[2];
-  if (socketpair(AF_UNIX, SOCK_STREAM, 0, fds) != 0) abort();
-  int buffer = 1 << 20;  // the whole input fits, so one thread can write it all first
-  setsockopt(fds[1], SOL_SOCKET, SO_SNDBUF, &buffer, sizeof(buffer));
-  setsockopt(fds[0], SOL_SOCKET, SO_RCVBUF, &buffer, sizeof(buffer));
-  size_t written = 0;
-  while (written < size) {
-    ssize_t n = send(fds[1], data + written, size - written, MSG_DONTWAIT | MSG_NOSIGNAL);
-    if (n <= 0) break;  // what does not fit is simply not part of this input
-    written += static_cast<size_t>(n);
-  }
-  close(fds[1]);
+  const int input = InputSocket(data, size);
 
   int result;
   {
     Channel channel(81920);
-    if (channel.Open(fds[0], true) != 0) abort();
+    if (channel.Open(input, true) != 0) abort();
     channel.SetTimeout(1);
     PStream stream;
     stream.SetDefaultRecvLocation(ScratchDir());
