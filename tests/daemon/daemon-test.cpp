@@ -1,4 +1,4 @@
-// plovod's command handler in this process, on a sandbox's repository: its
+// plovod's command handler in this process, served on the sandbox's socket: its
 // refusals, what a change leaves on disk and a failed one does not, and
 // runs, with the default job and with one that blocks until cancelled.
 #include <gmock/gmock.h>
@@ -9,7 +9,9 @@
 #include <memory>
 
 #include "daemon-sandbox.h"
+#include "common/paths.h"
 #include "daemon/daemon.h"
+#include "ipc/command-server.h"
 #include "ipc/error-code.h"
 
 namespace {
@@ -20,14 +22,20 @@ const char* const kLists[] = {"white_name", "white_ext", "black_name", "black_ex
 class DaemonTest : public plovo_test::DaemonSandboxTest {
  protected:
   void TearDown() override {
+    server_.reset();
     daemon_.reset();
     DaemonSandboxTest::TearDown();
   }
-  void Start(plovod::Job job = plovod::CopyNewFiles) {
-    daemon_ = std::make_unique<plovod::Daemon>(RepoPath(), false, [] {}, job);
+  // The daemon of this process on the sandbox's socket, asked as the
+  // module asks it (Do); its runs use job.
+  void Start(plovod::Job job = plovod::CopyNewFiles, bool beep = false) {
+    server_.reset();
+    daemon_ = std::make_unique<plovod::Daemon>(RepoPath(), beep, [] {}, job);
     ASSERT_EQ(daemon_->Open(), 0);
+    server_ = std::make_unique<CommandServer>(daemon_->Commands(),
+                                              [this](const PObject& request) { return daemon_->Handle(request); });
+    ASSERT_EQ(server_->Start(Plovo::Path::DaemonSocket()), 0);
   }
-  PObject Do(const PObject& request) override { return daemon_->Handle(request); }
   static PObject SetRequest(unsigned long id, const std::string& name) {
     return With(With(AddTaskRequest(name, "/DCIM2", "/new"), "action", "set_task_setting"), "task_id", Num(id));
   }
@@ -48,7 +56,8 @@ class DaemonTest : public plovo_test::DaemonSandboxTest {
 
   std::atomic<int> started_{0}, cancelled_{0};
   std::atomic<plovod::RunControl*> control_{nullptr};  // the latest run's; it lives until the next starts
-  std::unique_ptr<plovod::Daemon> daemon_;             // last: its runs use the members above
+  std::unique_ptr<plovod::Daemon> daemon_;             // its runs use the members above
+  std::unique_ptr<CommandServer> server_;              // last: it serves daemon_
 };
 
 TEST_F(DaemonTest, RefusalsCarryTheirCodeAndChangeNothing) {
@@ -140,6 +149,7 @@ TEST_F(DaemonTest, ChangesLandInRowListsSchedulerAndDeviceRowAndOutliveARestart)
   ASSERT_TRUE(Ok(SetRequest(ver, "Renamed")));
   EXPECT_EQ(EntryField(schedule, "name"), "Renamed");
   const std::string listed = Do(Action("list_task")).toString();
+  server_.reset();
   daemon_.reset();
   Start();
   EXPECT_EQ(Do(Action("list_task")).toString(), listed);
@@ -270,8 +280,7 @@ TEST_F(DaemonTest, RunStaysInItsFoldersAndReplacesNothing) {
 // buzzer sounds at its start and end when the beep is on.
 TEST_F(DaemonTest, SuccessfulRunEjectsAndBeeps) {
   WriteFile("/usbshare1/DCIM/a.jpg", "a");
-  daemon_ = std::make_unique<plovod::Daemon>(RepoPath(), true, [] {});
-  ASSERT_EQ(daemon_->Open(), 0);
+  Start(plovod::CopyNewFiles, true);
   const unsigned long id = Add(With(AddTaskRequest("Card"), "eject_when_task_done", Num(1)));
   ASSERT_TRUE(Ok(OnTask("run_task", id)));
   const PObject done = WaitIdle(id);

@@ -193,10 +193,11 @@ TEST_F(PlovodTest, HostileAndManyClientsHoldNoOneElseUp) {
 TEST_F(PlovodTest, LongRunsAndTheNotifier) {
   ASSERT_EQ(Service("start"), 0);
   const unsigned long id = Add(AddTaskRequest("Card"));
-  // A long run delays no command, and a cancelled one leaves no partial file.
+  // A long run delays no command, and one cancelled while it copies leaves
+  // no partial file.
   BigSource();
   ASSERT_TRUE(Ok(OnTask("run_task", id)));
-  EXPECT_EQ(Listed(id)["task_status"].asStringRef(), "running");
+  ASSERT_TRUE(Eventually([&] { return !Listed(id)["copy_file_path"].asStringRef().empty(); }));
   EXPECT_EQ(Get(id)["task_name"].asStringRef(), "Card");
   const PObject cancelled = Do(OnTask("cancel_task", id));
   // A run that ended between the two commands is not running any more (8).
