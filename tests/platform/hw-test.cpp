@@ -7,7 +7,7 @@
 #include <velt/share.h>
 
 #include <filesystem>
-#include <regex>
+#include <sstream>
 #include <sstream>
 #include <string>
 #include <thread>
@@ -76,10 +76,12 @@ TEST_F(HardwareTest, EjectAndBeepLogTheirEvents) {
   EXPECT_EQ(VLIBC_ERR_BAD_PARAMETER, VLIBCErrGet());
   EXPECT_TRUE(VELTShareEject("sdcard") == 0 && VELTBuzzerBeep(VELT_BEEP_SHORT) == 0 &&
               VELTBuzzerBeep(VELT_BEEP_LONG) == 0);
-  const std::regex stamp("(^|\n)[^\t\n]*");  // each line's time stamp
+  std::istringstream log(ReadFile("/velt-dev/system.log"));
+  std::string unstamped;  // each line without its time stamp
+  for (std::string line; std::getline(log, line);) unstamped += line.substr(line.find('\t')) + "\n";
   EXPECT_EQ("\t1\t1\t0x11A00101\tStorage\tsdcard\tejected\t\n"
             "\t1\t1\t0x11A00201\tBuzzer\tshort\t\t\n\t1\t1\t0x11A00201\tBuzzer\tlong\t\t\n",
-            std::regex_replace(ReadFile("/velt-dev/system.log"), stamp, "$1"));
+            unstamped);
   VeltDevFailCall("VELTLogSet1", 1, 0, VLIBC_ERR_IO);
   EXPECT_TRUE(VELTBuzzerBeep(VELT_BEEP_SHORT) == -1 && VLIBCErrGet() == VLIBC_ERR_IO);
   EXPECT_EQ(-1, VELTShareEject(""));
