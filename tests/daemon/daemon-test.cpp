@@ -36,6 +36,9 @@ class DaemonTest : public plovo_test::DaemonSandboxTest {
                                               [this](const PObject& request) { return daemon_->Handle(request); });
     ASSERT_EQ(server_->Start(Plovo::Path::DaemonSocket()), 0);
   }
+  // Asked in process when direct_: a socket's round trip mostly misses the
+  // moment a run ends.
+  PObject Do(const PObject& request) override { return direct_ ? daemon_->Handle(request) : Send(request); }
   static PObject SetRequest(unsigned long id, const std::string& name) {
     return With(With(AddTaskRequest(name, "/DCIM2", "/new"), "action", "set_task_setting"), "task_id", Num(id));
   }
@@ -55,6 +58,7 @@ class DaemonTest : public plovo_test::DaemonSandboxTest {
   }
 
   std::atomic<int> started_{0}, cancelled_{0};
+  bool direct_ = false;
   std::atomic<plovod::RunControl*> control_{nullptr};  // the latest run's; it lives until the next starts
   std::unique_ptr<plovod::Daemon> daemon_;             // its runs use the members above
   std::unique_ptr<CommandServer> server_;              // last: it serves daemon_
@@ -197,13 +201,14 @@ TEST_F(DaemonTest, RunCopiesWhatTheDestinationLacks) {
 // Each run ends, at once or within 2 ms, with a code of its own: the map
 // that first shows the task idle again must show that run's code. Only a
 // map read just as a run ends could show the one before, so the list is
-// read without a pause, over many runs.
+// read in process without a pause, over many runs.
 TEST_F(DaemonTest, AnIdleTaskShowsItsLastRunsOutcome) {
   Start([this](const plovod::RunPlan&, plovod::RunControl&) {  // one run at a time
     std::this_thread::sleep_for(std::chrono::microseconds(100 * (started_ % 20)));
     return -1 - started_++ % 20;
   });
   const unsigned long id = Add(AddTaskRequest("Card"));
+  direct_ = true;
   for (int i = 0; i < 1000; ++i) {
     ASSERT_TRUE(Ok(OnTask("run_task", id)));
     ASSERT_EQ(WaitIdle(id, std::chrono::microseconds(0))["error_code"].asInt64(), -1 - i % 20) << "run " << i;
