@@ -208,7 +208,7 @@ Daemon::Daemon(const std::string& repo, bool beep, std::function<void()> stop, J
     : store_(repo),
       beep_(beep),
       stop_(std::move(stop)),
-      runner_(std::move(job), [this](const RunPlan& plan, int error) { RunFinished(plan, error); }) {}
+      runner_(std::move(job), [this](const RunPlan& plan, const RunStats&, int error) { RunFinished(plan, error); }) {}
 
 const std::map<std::string, Daemon::Handler>& Daemon::Table() {
   static const std::map<std::string, Handler> table = {

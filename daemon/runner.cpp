@@ -17,18 +17,6 @@
 
 namespace plovod {
 
-// ---- RunControl --------------------------------------------------------------
-
-void RunControl::SetCopying(const std::string& path) {
-  std::lock_guard<std::mutex> lock(mutex_);
-  copying_ = path;
-}
-
-std::string RunControl::Copying() const {
-  std::lock_guard<std::mutex> lock(mutex_);
-  return copying_;
-}
-
 // ---- Runner ------------------------------------------------------------------
 
 bool Runner::Start(const RunPlan& plan) {
@@ -41,7 +29,7 @@ bool Runner::Start(const RunPlan& plan) {
   run->thread = std::thread([this, started] {
     const int error = Plovo::NoThrow([&] { return job_(started->plan, started->control); },
                                      static_cast<int>(P_ERR_SYSTEM));
-    finished_(started->plan, error);
+    finished_(started->plan, started->control.stats, error);
     std::lock_guard<std::mutex> lock(mutex_);
     started->done = true;
   });
@@ -64,14 +52,14 @@ bool Runner::Cancel(unsigned long id) {
   std::lock_guard<std::mutex> lock(mutex_);
   auto it = runs_.find(id);
   if (it == runs_.end() || it->second->done) return false;
-  it->second->control.Cancel();
+  it->second->control.Cancel(P_ERR_STOPPED);
   return true;
 }
 
 void Runner::CancelOnShare(const std::string& share) {
   std::lock_guard<std::mutex> lock(mutex_);
   for (auto& [id, run] : runs_) {
-    if (run->plan.device_share == share) run->control.Cancel();
+    if (run->plan.device_share == share) run->control.Cancel(P_ERR_SHARE_NOT_MOUNTED);
   }
 }
 
@@ -109,7 +97,7 @@ void Runner::StopAll() {
   {
     std::lock_guard<std::mutex> lock(mutex_);
     stopping_ = true;
-    for (auto& [id, run] : runs_) run->control.Cancel();
+    for (auto& [id, run] : runs_) run->control.Cancel(P_ERR_STOPPED);
     runs.swap(runs_);
   }
   // Without the lock: a run's last step takes it.

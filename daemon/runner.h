@@ -6,6 +6,7 @@
 #define PLOVO_DAEMON_RUNNER_H
 
 #include <atomic>
+#include <ctime>
 #include <functional>
 #include <map>
 #include <memory>
@@ -14,33 +15,9 @@
 #include <string>
 #include <thread>
 
+#include "daemon/engine/run-control.h"
+
 namespace plovod {
-
-// What one run does, fixed when it starts.
-struct RunPlan {
-  unsigned long id = 0;
-  std::string source_root;       // the share the source lies in
-  std::string source;            // the folder copied from, below source_root
-  std::string destination_root;  // the share the destination lies in
-  std::string destination;       // the folder copied into, below destination_root
-  std::string device_share;  // the device's share: pulling it out cancels the run
-  bool eject = false;        // eject the device after a run that succeeded
-};
-
-// A run as its job sees it. Thread-safe.
-class RunControl {
- public:
-  bool Cancelled() const { return cancelled_; }
-  void Cancel() { cancelled_ = true; }
-  // The file being copied now ("" between files), shown in the task list.
-  void SetCopying(const std::string& path);
-  std::string Copying() const;
-
- private:
-  std::atomic<bool> cancelled_{false};
-  mutable std::mutex mutex_;
-  std::string copying_;
-};
 
 // Copies plan.source into plan.destination, looking at control between
 // blocks: 0, or a negative code of ipc/error-code.h (P_ERR_STOPPED when
@@ -51,7 +28,7 @@ class Runner {
  public:
   // finished is called on the run's thread with the job's result, before
   // the task counts as idle again.
-  using Finished = std::function<void(const RunPlan& plan, int error)>;
+  using Finished = std::function<void(const RunPlan& plan, const RunStats& stats, int error)>;
   Runner(Job job, Finished finished) : job_(std::move(job)), finished_(std::move(finished)) {}
   ~Runner() { StopAll(); }
   Runner(const Runner&) = delete;

@@ -1,0 +1,1 @@
+#include "daemon/engine/capture-time.h"
