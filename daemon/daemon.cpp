@@ -8,6 +8,7 @@
 #include <set>
 
 #include "common/log.h"
+#include "ipc/error-code.h"
 #include "daemon/devices.h"
 #include "velt/hw.h"
 #include "velt/share.h"
@@ -198,17 +199,36 @@ bool Inside(const std::string& inner, const std::string& outer) {
   return inner.compare(0, outer.size(), outer) == 0 && (inner.size() == outer.size() || inner[outer.size()] == '/');
 }
 
+// Why a run failed, for its row.
+std::string FailureText(int error) {
+  switch (error) {
+    case P_ERR_DEST_ROOT_MISSING: return "the destination folder cannot be made";
+    case P_ERR_FILE_OPERATION: return "a file operation failed";
+    default: return "an internal error (" + std::to_string(error) + ")";
+  }
+}
+
 // PObject integers are unsigned on the wire; a negative number travels as
 // its 64-bit two's complement and the module reads it back as signed.
 PObject Signed(long value) { return PObject(static_cast<uint64_t>(value)); }
 
 }  // namespace
 
-Daemon::Daemon(const std::string& repo, bool beep, std::function<void()> stop, Job job)
-    : store_(repo),
+Daemon::Daemon(const std::string& repo, bool beep, std::function<void()> stop, Job job,
+               std::function<time_t()> clock)
+    : repo_(repo),
+      store_(repo),
+      clock_(std::move(clock)),
       beep_(beep),
       stop_(std::move(stop)),
-      runner_(std::move(job), [this](const RunPlan& plan, const RunStats&, int error) { RunFinished(plan, error); }) {}
+      runner_(std::move(job),
+              [this](const RunPlan& plan, const RunStats& stats, int error) { RunFinished(plan, stats, error); }) {}
+
+int Daemon::Open() {
+  if (store_.Open() != 0) return -1;
+  if (log_.Open(repo_ + "/db/log-db.sqlite") != 0) PLOVO_LOG(LOG_WARNING, "the copy log cannot be opened");
+  return 0;
+}
 
 const std::map<std::string, Daemon::Handler>& Daemon::Table() {
   static const std::map<std::string, Handler> table = {
@@ -264,6 +284,7 @@ void Daemon::Shutdown() {
   shutDown_ = true;
   runner_.StopAll();
   store_.Close();
+  log_.Close();
 }
 
 PObject Daemon::Describe(const StoredTask& task, const std::vector<PluggedDevice>& plugged, bool running) {
@@ -484,6 +505,13 @@ Code Daemon::StartRun(const StoredTask& task, std::string& why) {
   plan.destination = IsExport(info) ? usb : nas;
   plan.device_share = device.share_name;
   plan.eject = task.device.eject_when_task_done;
+  plan.task = info;
+  plan.task_folder = store_.TaskDir(info.id);
+  plan.started = clock_();
+  plan.destination_fat = IsExport(info) && device.fat;
+  plan.log = &log_;
+  // Logged before the run can end, so that its rows come in order.
+  log_.Add(info.id, Event::kRunStarted, {info.task_name});
   if (!runner_.Start(plan)) {
     why = "the task is running";
     return kConflict;
@@ -503,14 +531,29 @@ PObject Daemon::RunTask(const PObject& request) {
   return Ok();
 }
 
-void Daemon::RunFinished(const RunPlan& plan, int error) {
-  store_.RecordRun(plan.id, error, error == 0 ? static_cast<unsigned int>(std::time(nullptr)) : 0);
-  PLOVO_LOG(error == 0 ? LOG_INFO : LOG_WARNING, "run of task %lu ended: %d", plan.id, error);
+void Daemon::RunFinished(const RunPlan& plan, const RunStats& stats, int error) {
+  store_.RecordRun(plan.id, error, static_cast<unsigned int>(std::time(nullptr)));
+  const std::string& name = plan.task.task_name;
+  switch (error) {
+    case P_SUCCESS:
+      log_.Add(plan.id, Event::kRunFinished,
+               {name, std::to_string(stats.copied), std::to_string(stats.bytes), std::to_string(stats.removed)});
+      break;
+    case P_ERR_STOPPED: log_.Add(plan.id, Event::kRunCancelled, {name}, error); break;
+    case P_ERR_SHARE_NOT_MOUNTED: log_.Add(plan.id, Event::kDevicePulled, {name, plan.device_share}, error); break;
+    case P_ERR_DEST_QUOTA_FULL: log_.Add(plan.id, Event::kDestinationFull, {name, DestinationShown(plan)}, error); break;
+    case P_ERR_SOURCE_ROOT_MISSING: log_.Add(plan.id, Event::kSourceMissing, {name, SourceShown(plan)}, error); break;
+    default: log_.Add(plan.id, Event::kRunFailed, {name, FailureText(error)}, error); break;
+  }
+  PLOVO_LOG(error == 0 ? LOG_INFO : LOG_WARNING, "run of task %lu ended: %d (%lu copied, %lu linked, %lu removed, %lu skipped)",
+            plan.id, error, stats.copied, stats.linked, stats.removed, stats.skipped);
   if (beep_) VELTBuzzerBeep(VELT_BEEP_LONG);
   // Only once nothing else copies from or to the device.
-  if (error == 0 && plan.eject && !runner_.BusyOnShare(plan.device_share, plan.id) &&
-      VELTShareEject(plan.device_share.c_str()) != 0) {
+  if (error != 0 || !plan.eject || runner_.BusyOnShare(plan.device_share, plan.id)) return;
+  if (VELTShareEject(plan.device_share.c_str()) != 0) {
     PLOVO_LOG(LOG_WARNING, "cannot eject the device of share %s", plan.device_share.c_str());
+  } else {
+    log_.Add(plan.id, Event::kDeviceEjected, {plan.device_share});
   }
 }
 
@@ -564,6 +607,7 @@ PObject Daemon::DeviceAdded(const PObject& request) {
     if (plugged.share_name == share) device = plugged;
   }
   if (device.share_name.empty()) return Error(kDeviceAbsent);
+  log_.Add(0, Event::kDevicePlugged, {device.share_name, device.producer, device.product});
   std::vector<StoredTask> tasks;
   if (Code failed = store_.List(tasks)) return Error(failed);
   for (const StoredTask& task : tasks) {

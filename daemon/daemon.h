@@ -9,6 +9,7 @@
 #define PLOVO_DAEMON_DAEMON_H
 
 #include <atomic>
+#include <ctime>
 #include <functional>
 #include <map>
 #include <mutex>
@@ -16,6 +17,8 @@
 #include <vector>
 
 #include "daemon/devices.h"
+#include "daemon/engine/copy-log.h"
+#include "daemon/engine/engine.h"
 #include "daemon/runner.h"
 #include "daemon/task-store.h"
 #include "ipc/command-server.h"
@@ -27,14 +30,18 @@ class Daemon {
  public:
   // repo is the repository folder ("<volume>/@Plovo"); stop is called when
   // a "stop" command arrives (on a server thread) and must only ask the
-  // main thread to end. beep is the global setting at start.
-  Daemon(const std::string& repo, bool beep, std::function<void()> stop, Job job = CopyNewFiles);
+  // main thread to end. beep is the global setting at start. clock gives
+  // a run's start time (its version's name and rotation); tests set it.
+  Daemon(const std::string& repo, bool beep, std::function<void()> stop, Job job = RunCopy,
+         std::function<time_t()> clock = [] { return std::time(nullptr); });
   ~Daemon() { Shutdown(); }
   Daemon(const Daemon&) = delete;
   Daemon& operator=(const Daemon&) = delete;
 
-  // Opens the task database; 0, or -1 (logged).
-  int Open() { return store_.Open(); }
+  // Opens the task database and the copy log; 0, or -1 (logged) when the
+  // task database cannot be opened. Without its log the daemon still
+  // copies.
+  int Open();
   // Every action with its handler, for the CommandServer.
   std::vector<CommandServer::Command> Commands();
   // The answer to an action that is not in the table.
@@ -71,13 +78,17 @@ class Daemon {
   PObject Describe(const StoredTask& task, const std::vector<PluggedDevice>& plugged, bool running);
   // Starts a run of the task; kOk or why not.
   Code StartRun(const StoredTask& task, std::string& why);
-  // Called on a run's thread when it ends.
-  void RunFinished(const RunPlan& plan, int error);
+  // Called on a run's thread when it ends: records the outcome, writes its
+  // row, beeps and ejects.
+  void RunFinished(const RunPlan& plan, const RunStats& stats, int error);
 
   static const std::map<std::string, Handler>& Table();
 
   std::mutex mutex_;  // one command at a time
+  std::string repo_;
   TaskStore store_;
+  CopyLog log_;
+  std::function<time_t()> clock_;
   std::atomic<bool> beep_;
   std::function<void()> stop_;
   Runner runner_;  // last: its runs use the store

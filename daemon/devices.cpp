@@ -27,6 +27,8 @@ std::vector<PluggedDevice> ListPluggedDevices() {
       }
       plugged.producer = device["producer"].isString() ? device["producer"].asString() : "";
       plugged.product = device["product"].isString() ? device["product"].asString() : "";
+      const Json::Value& fs = partition["file_system"];
+      plugged.fat = fs.isString() && (fs.asString() == "vfat" || fs.asString() == "fat" || fs.asString() == "fat32");
       found.push_back(plugged);
     }
   }

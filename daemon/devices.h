@@ -17,6 +17,9 @@ struct PluggedDevice {
   std::string share_path;  // its mount point
   std::string producer;
   std::string product;
+  // Its partition's file system is FAT (the platform says "vfat", "fat"
+  // or "fat32"): no file of 4 GiB or more, no name with "*:<>?\| in it.
+  bool fat = false;
 };
 
 // Every mounted partition the storage service lists, in its order. A

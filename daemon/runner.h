@@ -68,15 +68,6 @@ class Runner {
   bool stopping_ = false;
 };
 
-// The job of a run until the copy engine takes over: every regular file of
-// the source tree whose name the destination does not hold yet is copied,
-// through a temporary name in its destination folder, synced, and put in
-// place. Both trees are walked below their shares without following a
-// link. Links, other special files, the platform's "@eaDir" folders and
-// the temporary files of a run that was killed are left out; nothing at
-// the destination is ever replaced or removed.
-int CopyNewFiles(const RunPlan& plan, RunControl& control);
-
 }  // namespace plovod
 
 #endif

@@ -19,4 +19,32 @@ std::string RunControl::Copying() const {
   return copying_;
 }
 
+namespace {
+
+// "/<share>" and the folder without empty components ("/" adds nothing).
+std::string Shown(const std::string& share, const std::string& folder) {
+  std::string shown = "/" + share;
+  for (size_t begin = 0; begin < folder.size();) {
+    size_t end = folder.find('/', begin);
+    if (end == std::string::npos) end = folder.size();
+    if (end > begin) shown += "/" + folder.substr(begin, end - begin);
+    begin = end + 1;
+  }
+  return shown;
+}
+
+}  // namespace
+
+std::string SourceShown(const RunPlan& plan) {
+  const TaskDB::TaskInfo& task = plan.task;
+  return task.task_type == 2 ? Shown(task.nas_share_name, task.nas_folder_path)
+                             : Shown(plan.device_share, task.usb_folder_path);
+}
+
+std::string DestinationShown(const RunPlan& plan) {
+  const TaskDB::TaskInfo& task = plan.task;
+  return task.task_type == 2 ? Shown(plan.device_share, task.usb_folder_path)
+                             : Shown(task.nas_share_name, task.nas_folder_path);
+}
+
 }  // namespace plovod

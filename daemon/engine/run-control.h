@@ -59,6 +59,11 @@ class RunControl {
   std::string copying_;
 };
 
+// A run's folders as the page shows them: "/<share>/<folder>", the share
+// being the device's or the NAS share by the task's direction.
+std::string SourceShown(const RunPlan& plan);
+std::string DestinationShown(const RunPlan& plan);
+
 }  // namespace plovod
 
 #endif

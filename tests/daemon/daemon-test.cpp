@@ -28,7 +28,7 @@ class DaemonTest : public plovo_test::DaemonSandboxTest {
   }
   // The daemon of this process on the sandbox's socket, asked as the
   // module asks it (Do); its runs use job.
-  void Start(plovod::Job job = plovod::CopyNewFiles, bool beep = false) {
+  void Start(plovod::Job job = plovod::RunCopy, bool beep = false) {
     server_.reset();
     daemon_ = std::make_unique<plovod::Daemon>(RepoPath(), beep, [] {}, job);
     ASSERT_EQ(daemon_->Open(), 0);
@@ -176,14 +176,14 @@ TEST_F(DaemonTest, RunCopiesWhatTheDestinationLacks) {
   WriteFile("/usbshare1/DCIM/sub/b.jpg", "beta");
   WriteFile("/usbshare1/DCIM/@eaDir/thumb", "t");
   Start();
-  const unsigned long id = Add(AddTaskRequest("Card"));
+  const unsigned long id = Add(With(AddTaskRequest("Card"), "copy_strategy", Num(3)));
   ASSERT_TRUE(Ok(OnTask("run_task", id)));
   const PObject done = WaitIdle(id);
   EXPECT_TRUE(done["error_code"].asInt64() == 0 && done["latest_finish_time"].asUInt64() != 0) << done.toString();
   EXPECT_EQ(ReadFile("/volume1/photo/card/a.jpg") + ReadFile("/volume1/photo/card/sub/b.jpg"), "alphabeta");
   EXPECT_FALSE(Exists("/volume1/photo/card/@eaDir"));
 
-  // A copy already there (same size and time) is kept; only the new file goes.
+  // A file copied before is not copied again, even changed at the NAS.
   WriteFile("/volume1/photo/card/a.jpg", "ALPHA");
   std::filesystem::last_write_time(Path("/volume1/photo/card/a.jpg"),
                                    std::filesystem::last_write_time(Path("/usbshare1/DCIM/a.jpg")));
@@ -255,10 +255,11 @@ TEST_F(DaemonTest, RunStaysInItsFoldersAndReplacesNothing) {
   ASSERT_EQ(mkfifo(Path("/usbshare1/DCIM/f.jpg").c_str(), 0644), 0);
   WriteFile("/volume1/photo/card/a.jpg", "the user's own");
   Start();
-  const unsigned long id = Add(AddTaskRequest("Card"));
+  const unsigned long id = Add(With(AddTaskRequest("Card"), "copy_strategy", Num(3)));
   ASSERT_TRUE(Ok(OnTask("run_task", id)));
   EXPECT_EQ(WaitIdle(id)["error_code"].asInt64(), 0);
   EXPECT_EQ(ReadFile("/volume1/photo/card/a.jpg"), "the user's own");
+  EXPECT_EQ(ReadFile("/volume1/photo/card/a (1).jpg"), "card");
   EXPECT_EQ(ReadFile("/volume1/photo/card/b.jpg"), "card b");
   for (const char* absent : {"/linked", "/f.jpg", "/.plovo-abcdefgh"}) {
     EXPECT_FALSE(Exists(std::string("/volume1/photo/card") + absent)) << absent;
@@ -285,7 +286,7 @@ TEST_F(DaemonTest, RunStaysInItsFoldersAndReplacesNothing) {
 // buzzer sounds at its start and end when the beep is on.
 TEST_F(DaemonTest, SuccessfulRunEjectsAndBeeps) {
   WriteFile("/usbshare1/DCIM/a.jpg", "a");
-  Start(plovod::CopyNewFiles, true);
+  Start(plovod::RunCopy, true);
   const unsigned long id = Add(With(AddTaskRequest("Card"), "eject_when_task_done", Num(1)));
   ASSERT_TRUE(Ok(OnTask("run_task", id)));
   const PObject done = WaitIdle(id);
