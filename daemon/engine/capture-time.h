@@ -16,10 +16,11 @@ namespace plovod {
 bool IsPhoto(const std::string& name);
 bool IsVideo(const std::string& name);
 
-// The EXIF DateTimeOriginal of the open file fd (read from its start; the
-// offset is not used), as local calendar fields; false when the file has
-// none, or one that is not a valid date. Reads at most the EXIF block, so
-// a hostile file costs a bounded amount of memory and time.
+// The EXIF DateTimeOriginal of the open file fd, a JPEG or a TIFF-based
+// raw (read from its start; the offset is not used), as local calendar
+// fields; false when the file has none, or one that is not a valid date.
+// Reads no more than the file's first 256 KiB, where the EXIF block lies,
+// so a hostile file costs a bounded amount of memory and time.
 bool ExifCaptureTime(int fd, std::tm& taken);
 
 // The capture time of the file name in its open folder: for a photo its

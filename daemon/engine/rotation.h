@@ -33,7 +33,9 @@ std::string VersionName(time_t started, int sequence = 1);
 bool ParseVersionName(const std::string& name, time_t& started);
 
 // The indexes into versions (start times, in any order) of the versions
-// rotation removes at now. Policy 1 or 2 as above; max of 0 is taken as 1.
+// rotation removes at now, in ascending order. Policy 2 as above, any other
+// only keeps max; max of 0 is taken as 1. Of two versions with the same
+// start time, the one at the later index counts as the newer.
 std::vector<size_t> VersionsToRemove(const std::vector<time_t>& versions, time_t now, unsigned long max,
                                      int policy);
 
