@@ -401,8 +401,11 @@ class Engine {
         continue;
       }
       if (S_ISDIR(st.st_mode)) {
-        const bool kept = sourceFolders_.count(path) != 0 || !lists_.AdmitsFolder(path);
-        if (!Prune(path) || kept || unlinkat(dir->get(), name.c_str(), AT_REMOVEDIR) != 0) empty = false;
+        // A folder the lists exclude is left whole, as the source's would be.
+        if (!lists_.AdmitsFolder(path) || !Prune(path) || sourceFolders_.count(path) != 0 ||
+            unlinkat(dir->get(), name.c_str(), AT_REMOVEDIR) != 0) {
+          empty = false;
+        }
       } else if (sourceFiles_.count(path) != 0 || !lists_.AdmitsFile(path, name)) {
         empty = false;
       } else if (unlinkat(dir->get(), name.c_str(), 0) == 0) {
