@@ -216,19 +216,14 @@ PObject Signed(long value) { return PObject(static_cast<uint64_t>(value)); }
 
 Daemon::Daemon(const std::string& repo, bool beep, std::function<void()> stop, Job job,
                std::function<time_t()> clock)
-    : repo_(repo),
-      store_(repo),
+    : store_(repo),
+      log_(repo + "/db/log-db.sqlite"),
       clock_(std::move(clock)),
       beep_(beep),
       stop_(std::move(stop)),
       runner_(std::move(job),
               [this](const RunPlan& plan, const RunStats& stats, int error) { RunFinished(plan, stats, error); }) {}
 
-int Daemon::Open() {
-  if (store_.Open() != 0) return -1;
-  if (log_.Open(repo_ + "/db/log-db.sqlite") != 0) PLOVO_LOG(LOG_WARNING, "the copy log cannot be opened");
-  return 0;
-}
 
 const std::map<std::string, Daemon::Handler>& Daemon::Table() {
   static const std::map<std::string, Handler> table = {

@@ -38,10 +38,8 @@ class Daemon {
   Daemon(const Daemon&) = delete;
   Daemon& operator=(const Daemon&) = delete;
 
-  // Opens the task database and the copy log; 0, or -1 (logged) when the
-  // task database cannot be opened. Without its log the daemon still
-  // copies.
-  int Open();
+  // Opens the task database; 0, or -1 (logged).
+  int Open() { return store_.Open(); }
   // Every action with its handler, for the CommandServer.
   std::vector<CommandServer::Command> Commands();
   // The answer to an action that is not in the table.
@@ -85,7 +83,6 @@ class Daemon {
   static const std::map<std::string, Handler>& Table();
 
   std::mutex mutex_;  // one command at a time
-  std::string repo_;
   TaskStore store_;
   CopyLog log_;
   std::function<time_t()> clock_;

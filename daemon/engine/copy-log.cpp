@@ -42,9 +42,19 @@ void CopyLog::Add(unsigned long task, Event event, const std::vector<std::string
   row.description_id = static_cast<unsigned int>(event);
   row.description_param = Json::writeString(writer, list);
   row.error = error;
-  if (db_.AddLogInfo(row) != 0) {
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (!opened_) opened_ = db_.Initialize(path_) == 0;
+  }
+  if (!opened_ || db_.AddLogInfo(row) != 0) {
     PLOVO_LOG(LOG_WARNING, "copy log: row %u of task %lu not written", row.description_id, task);
   }
+}
+
+void CopyLog::Close() {
+  std::lock_guard<std::mutex> lock(mutex_);
+  db_.Destroy();
+  opened_ = false;
 }
 
 }  // namespace plovod

@@ -11,6 +11,7 @@
 #ifndef PLOVO_DAEMON_ENGINE_COPY_LOG_H
 #define PLOVO_DAEMON_ENGINE_COPY_LOG_H
 
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -36,17 +37,21 @@ enum class Event : unsigned int {
 // The type an event is logged with: 1, 2 or 4.
 int EventType(Event event);
 
-// Writes rows; safe from several threads (LogDB locks each statement).
+// Writes rows; safe from several threads.
 class CopyLog {
  public:
-  // Opens (creating when absent) the log database at path; 0 or -1.
-  int Open(const std::string& path) { return db_.Initialize(path); }
-  void Close() { db_.Destroy(); }
+  // The log database's path. It is opened (and created when absent) with
+  // the first row, so that a daemon that logs nothing never touches it.
+  explicit CopyLog(std::string path) : path_(std::move(path)) {}
   // Adds one row stamped now; a row that cannot be written is reported in
   // the daemon's own log and otherwise ignored: the copy goes on.
   void Add(unsigned long task, Event event, const std::vector<std::string>& params, int error = 0);
+  void Close();
 
  private:
+  std::mutex mutex_;  // guards opened_ and the opening
+  bool opened_ = false;
+  std::string path_;
   LogDB db_;
 };
 
