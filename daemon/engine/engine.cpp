@@ -379,7 +379,7 @@ class Engine {
     }
     if (int error = placer_.Commit()) return error;
     Prune("");
-    return 0;
+    return Stopped();
   }
 
   // Removes from the destination folder what the source no longer has,
@@ -390,6 +390,7 @@ class Engine {
     if (!dir || !ListNames(dir->get(), names)) return false;
     bool empty = true;
     for (const std::string& name : names) {
+      if (control_.Cancelled()) return false;
       const std::string path = Join(folder, name);
       struct stat st {};
       if (IsTemporary(name)) {
