@@ -30,8 +30,12 @@ namespace {
 // NAS, never removed from the device.
 const char kDeviceConfig[] = ".VeltraPlovo.config";
 constexpr off_t kFatLargest = (off_t{4} << 30) - 1;
-// Rows remembered in one transaction of the incremental memory.
-constexpr int kMemoryBatch = 256;
+// Deeper folders are skipped with a row: no camera nests so deep, and
+// the walks hold a descriptor per level.
+constexpr size_t kMaxDepth = 128;
+// Past this many, skipped files are counted in one last row rather than
+// one row each, so that a hostile tree cannot flood the log.
+constexpr unsigned long kMaxSkipRows = 1000;
 
 std::string Join(const std::string& folder, const std::string& name) {
   return folder.empty() ? name : name.empty() ? folder : folder + "/" + name;
@@ -48,6 +52,8 @@ std::string Extension(const std::string& name) {
   return dot == std::string::npos || dot == 0 ? "" : name.substr(dot + 1);
 }
 
+size_t Depth(const std::string& path) { return path.empty() ? 0 : std::count(path.begin(), path.end(), '/') + 1; }
+
 // Whether a FAT file system can hold the name.
 bool FatName(const std::string& name) {
   if (name.empty() || name.back() == '.' || name.back() == ' ') return false;
@@ -63,12 +69,22 @@ bool ListNames(int dir, std::vector<std::string>& names) {
   DIR* stream = fdopendir(fcntl(dir, F_DUPFD_CLOEXEC, 0));
   if (stream == nullptr) return false;
   rewinddir(stream);
+  // A listing cut short by a read error is no listing: a mirror would
+  // take the missing names for files the source no longer has.
+  errno = 0;
   while (const dirent* entry = readdir(stream)) {
     if (strcmp(entry->d_name, ".") != 0 && strcmp(entry->d_name, "..") != 0) names.push_back(entry->d_name);
   }
+  const int error = errno;
   closedir(stream);
   std::sort(names.begin(), names.end());
-  return true;
+  errno = error;
+  return error == 0;
+}
+
+bool IsFolder(int dir, const std::string& name) {
+  struct stat st {};
+  return fstatat(dir, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(st.st_mode);
 }
 
 // Names no run ever copies or removes: the device's configuration, the
@@ -127,7 +143,8 @@ class Engine {
       : plan_(plan),
         control_(control),
         task_(plan.task),
-        placer_(destinationRoot, control),
+        placer_(destinationRoot, control,
+                [this](const std::string& shown) { Skip(shown, "a file of that name appeared at the destination"); }),
         sourceShown_(plovod::SourceShown(plan)),
         destinationShown_(plovod::DestinationShown(plan)) {}
 
@@ -147,8 +164,14 @@ class Engine {
     const int placed = placer_.Commit();
     if (error == 0) error = placed;
     if (memoryOpen_ && memory_.End() != 0 && error == 0) error = P_ERR_FILE_OPERATION;
-    if (!removals_.empty()) RemoveSources();
+    // The renames on the disk before any source goes: a power cut must
+    // not leave a source gone and its copy under a temporary name.
+    if (!removals_.empty() && syncfs(destination_) == 0) RemoveSources();
     if (error == 0 && task_.copy_strategy == 1 && task_.enable_rotation) Rotate();
+    if (control_.stats.skipped > kMaxSkipRows) {
+      Log(Event::kFileSkipped, {sourceShown_, std::to_string(control_.stats.skipped - kMaxSkipRows) +
+                                                  " more files could not be copied"});
+    }
     return error;
   }
 
@@ -157,8 +180,14 @@ class Engine {
     if (plan_.log != nullptr) plan_.log->Add(plan_.id, event, params, error);
   }
   void Skip(const std::string& shown, const std::string& why) {
-    ++control_.stats.skipped;
-    Log(Event::kFileSkipped, {shown, why});
+    if (++control_.stats.skipped <= kMaxSkipRows) Log(Event::kFileSkipped, {shown, why});
+  }
+  // A destination folder that cannot be made: the run ends only when the
+  // disk is full; otherwise the file has its row and the run goes on.
+  int FolderFailed(const SourceFile& file) {
+    if (errno == ENOSPC || errno == EDQUOT) return P_ERR_DEST_QUOTA_FULL;
+    Skip(SourceShown(file.Path()), std::string("its folder cannot be made at the destination: ") + strerror(errno));
+    return 0;
   }
   std::string SourceShown(const std::string& path) const { return sourceShown_ + "/" + path; }
   std::string DestinationShown(const std::string& path) const { return destinationShown_ + "/" + path; }
@@ -181,11 +210,18 @@ class Engine {
       Folder dir = OpenBelow(source_, folder, false);
       std::vector<std::string> names;
       if (!dir || !ListNames(dir->get(), names)) {
+        walkIncomplete_ = true;
         Skip(SourceShown(folder), std::string("the folder cannot be read: ") + strerror(errno));
+        continue;
+      }
+      if (Depth(folder) >= kMaxDepth) {
+        walkIncomplete_ = true;
+        Skip(SourceShown(folder), "the folder lies too deep");
         continue;
       }
       std::vector<std::string> below;
       for (const std::string& name : names) {
+        if (control_.Cancelled()) return;
         SourceFile file{folder, name, {}};
         const std::string path = file.Path();
         if (Untouchable(name) || fstatat(dir->get(), name.c_str(), &file.st, AT_SYMLINK_NOFOLLOW) != 0) continue;
@@ -237,6 +273,18 @@ class Engine {
     return dir;
   }
 
+  // Whether the destination can hold the folder's names.
+  bool FatPath(const std::string& path) const {
+    if (!plan_.destination_fat) return true;
+    for (size_t begin = 0; begin < path.size();) {
+      size_t end = path.find('/', begin);
+      if (end == std::string::npos) end = path.size();
+      if (!FatName(path.substr(begin, end - begin))) return false;
+      begin = end + 1;
+    }
+    return true;
+  }
+
   // Whether a FAT destination refuses the file; it then has its row.
   bool FatRefuses(const SourceFile& file, const std::string& destinationPath) {
     if (!plan_.destination_fat) return false;
@@ -245,17 +293,10 @@ class Engine {
       Log(Event::kFileTooLarge, {SourceShown(file.Path()), std::to_string(file.st.st_size)});
       return true;
     }
-    for (size_t begin = 0; begin <= destinationPath.size();) {
-      size_t end = destinationPath.find('/', begin);
-      if (end == std::string::npos) end = destinationPath.size();
-      if (!FatName(destinationPath.substr(begin, end - begin))) {
-        ++control_.stats.skipped;
-        Log(Event::kNameNotAllowed, {SourceShown(file.Path())});
-        return true;
-      }
-      begin = end + 1;
-    }
-    return false;
+    if (FatPath(destinationPath)) return false;
+    ++control_.stats.skipped;
+    Log(Event::kNameNotAllowed, {SourceShown(file.Path())});
+    return true;
   }
 
   // Copies one file into the open folder to as name: 0, or the run's
@@ -292,7 +333,7 @@ class Engine {
     for (const std::string& name : names) {
       time_t t;
       // The latest version; of two in one second, the one made last.
-      if (ParseVersionName(name, t) &&
+      if (ParseVersionName(name, t) && IsFolder(destination_, name) &&
           (previous.empty() || t > previousTime ||
            (t == previousTime && (name.size() > previous.size() || (name.size() == previous.size() && name > previous))))) {
         previous = name;
@@ -308,7 +349,8 @@ class Engine {
     Folder before = previous.empty() ? nullptr : OpenBelow(destination_, previous, false);
     if (!version) return P_ERR_FILE_OPERATION;
     for (const std::string& folder : folders_) {
-      if (!OpenBelow(version->get(), folder, true)) return P_ERR_FILE_OPERATION;
+      if (!FatPath(folder)) continue;
+      if (!OpenBelow(version->get(), folder, true) && (errno == ENOSPC || errno == EDQUOT)) return P_ERR_DEST_QUOTA_FULL;
     }
     Folder earlier;
     std::string earlierName = "\n";
@@ -316,7 +358,10 @@ class Engine {
       if (int error = Stopped()) return error;
       if (FatRefuses(file, file.Path())) continue;
       Folder to = DestinationFolder(version->get(), file.folder);
-      if (!to) return P_ERR_FILE_OPERATION;
+      if (!to) {
+        if (int error = FolderFailed(file)) return error;
+        continue;
+      }
       if (before && earlierName != file.folder) {
         earlier = OpenBelow(before->get(), file.folder, false);
         earlierName = file.folder;
@@ -340,7 +385,7 @@ class Engine {
     if (!ListNames(destination_, names)) return;
     for (const std::string& name : names) {
       time_t t;
-      if (ParseVersionName(name, t)) {
+      if (ParseVersionName(name, t) && IsFolder(destination_, name)) {
         versions.push_back(name);
         times.push_back(t);
       }
@@ -359,13 +404,19 @@ class Engine {
 
   int Mirror() {
     for (const std::string& folder : folders_) {
-      if (!DestinationFolder(destination_, folder, true)) return P_ERR_FILE_OPERATION;
+      if (!FatPath(folder)) continue;
+      if (!DestinationFolder(destination_, folder, true) && (errno == ENOSPC || errno == EDQUOT)) {
+        return P_ERR_DEST_QUOTA_FULL;
+      }
     }
     for (const SourceFile& file : files_) {
       if (int error = Stopped()) return error;
       if (FatRefuses(file, file.Path())) continue;
       Folder to = DestinationFolder(destination_, file.folder, true);
-      if (!to) return P_ERR_FILE_OPERATION;
+      if (!to) {
+        if (int error = FolderFailed(file)) return error;
+        continue;
+      }
       struct stat st {};
       if (fstatat(to->get(), file.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0) {
         if (Unchanged(st, file.st)) continue;
@@ -378,7 +429,9 @@ class Engine {
       if (int error = Copy(file, to, file.name, true, nullptr)) return error;
     }
     if (int error = placer_.Commit()) return error;
-    Prune("");
+    // What the walk could not see may still be on the source: nothing is
+    // removed on its word.
+    if (!walkIncomplete_) Prune("");
     return Stopped();
   }
 
@@ -387,7 +440,7 @@ class Engine {
   bool Prune(const std::string& folder) {
     Folder dir = OpenBelow(destination_, folder, false);
     std::vector<std::string> names;
-    if (!dir || !ListNames(dir->get(), names)) return false;
+    if (Depth(folder) >= kMaxDepth || !dir || !ListNames(dir->get(), names)) return false;
     bool empty = true;
     for (const std::string& name : names) {
       if (control_.Cancelled()) return false;
@@ -461,7 +514,10 @@ class Engine {
         if (task_.rename_photo_video) name = CaptureName(taken, name);
       }
       Folder to = DestinationFolder(destination_, folder);
-      if (!to) return errno == ENOSPC || errno == EDQUOT ? P_ERR_DEST_QUOTA_FULL : P_ERR_FILE_OPERATION;
+      if (!to) {
+        if (int error = FolderFailed(file)) return error;
+        continue;
+      }
       struct stat st {};
       const bool standing = fstatat(to->get(), name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0;
       bool replace = false;
@@ -481,11 +537,13 @@ class Engine {
         if (memory_.Remember(key, "/" + target, copied.st.st_size, copied.st.st_mtim.tv_sec, plan_.started) != 0) {
           PLOVO_LOG(LOG_WARNING, "task %lu: %s is not remembered", plan_.id, key.c_str());
         }
-        if (++remembered_ % kMemoryBatch == 0) memory_.End(), memory_.Begin();
         lastWriter_[target] = index;
         if (task_.remove_src_file) removals_.push_back({index, target});
       };
       if (int error = Copy(file, to, name, replace, placed)) return error;
+      // The memory's rows are committed with each batch put in place, so a
+      // killed daemon forgets at most the renames of one batch.
+      if (placer_.Empty()) memory_.End(), memory_.Begin();
     }
     return 0;
   }
@@ -499,8 +557,9 @@ class Engine {
       struct stat st {};
       const int from = SourceFolder(file.folder);
       if (lastWriter_[target] != index || from < 0 ||
-          fstatat(from, file.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0 || !S_ISREG(st.st_mode) ||
-          st.st_size != file.st.st_size || st.st_mtim.tv_sec != file.st.st_mtim.tv_sec) {
+          fstatat(from, file.name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0 || st.st_ino != file.st.st_ino ||
+          st.st_dev != file.st.st_dev || st.st_size != file.st.st_size ||
+          st.st_mtim.tv_sec != file.st.st_mtim.tv_sec) {
         continue;
       }
       if (unlinkat(from, file.name.c_str(), 0) == 0) {
@@ -533,7 +592,7 @@ class Engine {
   std::unordered_set<std::string> claimed_;
   std::unordered_map<std::string, size_t> lastWriter_;
   std::vector<std::pair<size_t, std::string>> removals_;
-  unsigned long remembered_ = 0;
+  bool walkIncomplete_ = false;  // a folder could not be read
 };
 
 }  // namespace

@@ -51,9 +51,11 @@ Folder OpenBelow(int base, const std::string& relative, bool create) {
   return dir->get() >= 0 ? dir : nullptr;
 }
 
-int RemoveEntry(int folder, const std::string& name) {
+int RemoveEntry(int folder, const std::string& name, int depth) {
   if (unlinkat(folder, name.c_str(), 0) == 0) return 0;
   if (errno != EISDIR && errno != EPERM) return -1;
+  // A descriptor per level: a tree deeper than any run makes stays.
+  if (depth > 256) return errno = ELOOP, -1;
   // A folder: its entries first, through the open folder, so that a link
   // inside is removed as a link and never followed.
   Plovo::UniqueFd dir(openat(folder, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
@@ -67,13 +69,14 @@ int RemoveEntry(int folder, const std::string& name) {
   closedir(stream);
   int result = 0;
   for (const std::string& child : names) {
-    if (RemoveEntry(dir.get(), child) != 0) result = -1;
+    if (RemoveEntry(dir.get(), child, depth + 1) != 0) result = -1;
   }
   if (result == 0 && unlinkat(folder, name.c_str(), AT_REMOVEDIR) != 0) result = -1;
   return result;
 }
 
-Placer::Placer(int destinationRoot, RunControl& control) : root_(destinationRoot), control_(control) {}
+Placer::Placer(int destinationRoot, RunControl& control, std::function<void(const std::string& shown)> dropped)
+    : root_(destinationRoot), control_(control), dropped_(std::move(dropped)) {}
 
 int Placer::Transfer(int in, int out, bool& fromSource) {
   while (kernelCopy_) {
@@ -117,6 +120,8 @@ Placer::Outcome Placer::Copy(int from, const std::string& name, const struct sta
     return kSkipped;
   }
   if (!S_ISREG(st.st_mode)) return why = "not a regular file", kSkipped;
+  // The file listed is the file copied (and the one a move removes).
+  if (st.st_ino != listed.st_ino || st.st_dev != listed.st_dev) return why = "the file was replaced meanwhile", kSkipped;
   const std::string temporary = kTemporaryPrefix + TmpNameGen::getInstance().getTmpName();
   Plovo::UniqueFd out(openat(to->get(), temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644));
   if (out.get() < 0) {
@@ -142,7 +147,7 @@ Placer::Outcome Placer::Copy(int from, const std::string& name, const struct sta
     }
     return error = P_ERR_FILE_OPERATION, kFailed;
   }
-  waiting_.push_back({to, temporary, finalName, replace, placed});
+  waiting_.push_back({to, temporary, finalName, replace, placed, shown});
   waitingBytes_ += static_cast<unsigned long long>(st.st_size);
   if (waiting_.size() >= kBatchFiles || waitingBytes_ >= kBatchBytes) {
     if ((error = Commit()) != 0) return kFailed;
@@ -183,7 +188,8 @@ int Placer::Commit() {
       continue;
     }
     // A file that appeared under the name meanwhile is the user's: kept.
-    if (errno != EEXIST) result = P_ERR_FILE_OPERATION;
+    if (errno == EEXIST) dropped_(file.shown);
+    else result = P_ERR_FILE_OPERATION;
     unlinkat(folder, temporary, 0);
   }
   return result;

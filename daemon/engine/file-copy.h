@@ -32,8 +32,9 @@ bool IsTemporary(const std::string& name);
 Folder OpenBelow(int base, const std::string& relative, bool create);
 
 // Removes the entry name of the open folder and, for a folder, everything
-// below it, without following links. 0, or -1 with errno set.
-int RemoveEntry(int folder, const std::string& name);
+// below it, without following links; a tree more than 256 levels deep is
+// left. 0, or -1 with errno set.
+int RemoveEntry(int folder, const std::string& name, int depth = 0);
 
 // Copies in batches: each file goes to a temporary name in its folder;
 // when the batch is full (or at Commit) the destination's file system is
@@ -48,7 +49,9 @@ class Placer {
   // How Copy ended for one file.
   enum Outcome { kCopied, kSkipped, kFailed };
 
-  Placer(int destinationRoot, RunControl& control);
+  // dropped is called with a file's shown path when a file of its name
+  // appeared at the destination meanwhile and was kept instead.
+  Placer(int destinationRoot, RunControl& control, std::function<void(const std::string& shown)> dropped);
   ~Placer() { Discard(); }
   Placer(const Placer&) = delete;
   Placer& operator=(const Placer&) = delete;
@@ -69,6 +72,8 @@ class Placer {
   int Commit();
   // Removes the waiting files' temporaries.
   void Discard();
+  // Whether no file waits: the last Copy put its batch in place.
+  bool Empty() const { return waiting_.empty(); }
 
  private:
   struct Waiting {
@@ -77,6 +82,7 @@ class Placer {
     std::string name;
     bool replace;
     Placed placed;
+    std::string shown;
   };
   // Writes the bytes of in to out, looking at the cancel between blocks.
   // 0, or the errno of the failing side: set fromSource when it was the
@@ -85,6 +91,7 @@ class Placer {
 
   int root_;
   RunControl& control_;
+  std::function<void(const std::string& shown)> dropped_;
   std::vector<Waiting> waiting_;
   unsigned long long waitingBytes_ = 0;
   std::vector<char> buffer_;
