@@ -347,4 +347,32 @@ TEST_F(EngineTest, SkippedFilesGetTheirRowAndTheRunGoesOn) {
   EXPECT_EQ(Rows(out).back(), "2/1 [\"Out\",\"0\",\"0\",\"0\"]");
 }
 
+// What a hostile tree may not cost: a folder too deep is skipped and stops
+// the mirror's removals (what the walk could not see may still be on the
+// card); a thousand special files flood no log; a user's file named like
+// a version is no version for rotation.
+TEST_F(EngineTest, HostileTreesCostNothingElse) {
+  std::string deep = "/usbshare1/DCIM/deep";
+  for (int i = 0; i < 130; ++i) deep += "/d";
+  WriteFile(deep + "/x.jpg", "deep");
+  WriteFile("/usbshare1/DCIM/a.jpg", "a");
+  for (int i = 0; i < 1005; ++i) ASSERT_EQ(mkfifo(Path("/usbshare1/DCIM/f" + std::to_string(i)).c_str(), 0644), 0);
+  WriteFile("/volume1/photo/mir/gone.jpg", "no longer on the card");
+  const unsigned long mir = Add(With(AddTaskRequest("Mir", "/DCIM", "/mir"), "copy_strategy", Num(2)));
+  EXPECT_EQ(RunTask(mir), 0);
+  EXPECT_EQ(Files("/volume1/photo/mir"), (Tree{{"a.jpg", "a"}, {"gone.jpg", "no longer on the card"}}));
+  const std::vector<std::string> rows = Rows(mir);
+  EXPECT_EQ(std::count_if(rows.begin(), rows.end(), [](const std::string& row) { return row.rfind("7/", 0) == 0; }),
+            1001);
+  EXPECT_THAT(rows, Contains("7/2 [\"/usbshare1/DCIM\",\"6 more files could not be copied\"]"));
+
+  WriteFile("/usbshare1/V/a.jpg", "a");
+  WriteFile("/volume1/photo/ver/" + plovod::VersionName(kStart - 86400), "the user's file");
+  const PObject add = With(AddTaskRequest("Ver", "/V", "/ver"), "enable_rotation", Num(1));
+  const unsigned long ver = Add(With(add, "max_version_count", Num(1)));
+  EXPECT_EQ(RunTask(ver), 0);
+  EXPECT_EQ(Files("/volume1/photo/ver"), (Tree{{plovod::VersionName(kStart - 86400), "the user's file"},
+                                               {plovod::VersionName(kStart) + "/a.jpg", "a"}}));
+}
+
 }  // namespace
