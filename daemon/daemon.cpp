@@ -527,6 +527,11 @@ PObject Daemon::RunTask(const PObject& request) {
 }
 
 void Daemon::RunFinished(const RunPlan& plan, const RunStats& stats, int error) {
+  // A device pulled out before the hot-plug hook said so fails the run
+  // with whatever the disk said; its share being gone says why.
+  if (error != 0 && error != P_ERR_STOPPED && MountedSharePath(plan.device_share).empty()) {
+    error = P_ERR_SHARE_NOT_MOUNTED;
+  }
   store_.RecordRun(plan.id, error, static_cast<unsigned int>(std::time(nullptr)));
   const std::string& name = plan.task.task_name;
   switch (error) {

@@ -168,6 +168,11 @@ class Engine {
     // not leave a source gone and its copy under a temporary name.
     if (!removals_.empty() && syncfs(destination_) == 0) RemoveSources();
     if (error == 0 && task_.copy_strategy == 1 && task_.enable_rotation) Rotate();
+    // A version that did not finish is no snapshot of the source: renamed
+    // so that neither a later run links to it nor rotation counts it.
+    if (error != 0 && !version_.empty()) {
+      renameat(destination_, version_.c_str(), destination_, (version_ + ".incomplete").c_str());
+    }
     if (control_.stats.skipped > kMaxSkipRows) {
       Log(Event::kFileSkipped, {sourceShown_, std::to_string(control_.stats.skipped - kMaxSkipRows) +
                                                   " more files could not be copied"});

@@ -373,6 +373,14 @@ TEST_F(EngineTest, HostileTreesCostNothingElse) {
   EXPECT_EQ(RunTask(ver), 0);
   EXPECT_EQ(Files("/volume1/photo/ver"), (Tree{{plovod::VersionName(kStart - 86400), "the user's file"},
                                                {plovod::VersionName(kStart) + "/a.jpg", "a"}}));
+  // A version cut short is marked as such: no later run takes it for one.
+  WriteFile("/usbshare1/V/big.bin", "");
+  fs::resize_file(Path("/usbshare1/V/big.bin"), 8ul << 30);
+  ASSERT_TRUE(Ok(OnTask("run_task", ver)));
+  ASSERT_TRUE(plovo_test::Eventually([&] { return !Listed(ver)["copy_file_path"].asStringRef().empty(); }));
+  ASSERT_TRUE(Ok(OnTask("cancel_task", ver)));
+  EXPECT_EQ(WaitIdle(ver)["error_code"].asInt64(), P_ERR_STOPPED);
+  EXPECT_EQ(ReadFile("/volume1/photo/ver/" + plovod::VersionName(kStart, 2) + ".incomplete/a.jpg"), "a");
 }
 
 }  // namespace
