@@ -153,6 +153,9 @@ TEST_F(PlovodTest, ReadmeWalkThroughTheModule) {
   EXPECT_THAT(Api("run", task), ok);
   EXPECT_TRUE(Eventually([this] { return PhotosArrived(); }));
   EXPECT_TRUE(Eventually([&] { return Api("get", task).find(R"("status":"idle")") != std::string::npos; }));
+  // The log screen's page: the run's end, then its start.
+  EXPECT_THAT(Api("get_log_list", R"({"limit": 2, "offset": 0, "log_filter": {"log_desc_id_list": [1, 2]}})"),
+              HasSubstr(R"("description_id":2,"description_parameter":"[\"Card\",\"2\",\"3\",\"0\"]")"));
   EXPECT_THAT(Api("cancel", task), ok);  // nothing runs: as the user wants it
   EXPECT_THAT(Api("delete", task), ok);
   EXPECT_THAT(Api("get", task), HasSubstr(R"("success":false)"));
