@@ -187,6 +187,12 @@ std::string Normalized(const std::string& folder) {
   return result;
 }
 
+// The side a task copies from: its direction and folder.
+std::string SourceOf(const TaskDB::TaskInfo& info) {
+  return IsExport(info) ? "nas:" + info.nas_share_name + Normalized(info.nas_folder_path)
+                        : "usb:" + Normalized(info.usb_folder_path);
+}
+
 // Where a share really is; "" when it is not there.
 std::string RealPath(const std::string& path) {
   if (path.empty()) return "";
@@ -407,6 +413,7 @@ PObject Daemon::SetTaskSetting(const PObject& request) {
   StoredTask task;
   if (Code failed = store_.Get(id, task)) return Error(failed);
   TaskDB::TaskInfo& info = task.info;
+  const std::string source = SourceOf(info);
   info.task_type = args.Choice("task_type", 1, 3);
   info.task_name = args.TaskName("task_name");
   info.usb_folder_path = args.Folder("usb_folder_path");
@@ -434,6 +441,9 @@ PObject Daemon::SetTaskSetting(const PObject& request) {
   if (Code failed = store_.Update(info)) {
     return Error(failed, failed == kConflict ? "the task name is taken" : "");
   }
+  // What an incremental task remembers is relative to its source: another
+  // source's files are not the ones it copied.
+  if (SourceOf(info) != source) store_.ForgetCopies(id);
   return Ok();
 }
 

@@ -298,6 +298,10 @@ Code TaskStore::Remove(unsigned long id) {
   return kOk;
 }
 
+void TaskStore::ForgetCopies(unsigned long id) {
+  for (const char* suffix : {"", "-wal", "-shm"}) unlink((TaskDir(id) + "/file-db.sqlite" + suffix).c_str());
+}
+
 void TaskStore::RecordRun(unsigned long id, int error, unsigned int finishTime) {
   std::lock_guard<std::mutex> lock(rowMutex_);
   if (db_.UpdateTaskInfo(id, error, finishTime) != 0) PLOVO_LOG(LOG_ERR, "cannot record the run of task %lu", id);

@@ -51,6 +51,9 @@ class TaskStore {
   void Close() { db_.Destroy(); }
 
   std::string TaskDir(unsigned long id) const;
+  // Removes the task's incremental memory ("file-db.sqlite"): its next
+  // run copies as a first one.
+  void ForgetCopies(unsigned long id);
 
   Code List(std::vector<StoredTask>& tasks);
   Code Get(unsigned long id, StoredTask& task);

@@ -71,7 +71,9 @@ bool ParseExifDate(const char* text, std::tm& taken) {
   t.tm_hour = Digits(text + 11, 2);
   t.tm_min = Digits(text + 14, 2);
   t.tm_sec = Digits(text + 17, 2);
-  if (t.tm_year < 1 - 1900) return false;  // year 0, or not digits
+  // Year 0, not digits, or a clock never set: such a date would make no
+  // date folder that sorts with the others.
+  if (t.tm_year < 1970 - 1900) return false;
   // timegm moves a field out of range into the next one (February 30th
   // becomes March 2nd), so a date that comes back changed was not one. It
   // also fills the week day and the day of the year.

@@ -107,7 +107,13 @@ class Lists {
     Json::Value config;
     std::ifstream in(taskFolder + "/user.config");
     Json::CharReaderBuilder reader;
-    if (in && Json::parseFromStream(reader, in, &config, nullptr) && config.isObject()) {
+    bool parsed = false;
+    try {
+      parsed = in && Json::parseFromStream(reader, in, &config, nullptr);
+    } catch (const std::exception&) {  // nested too deep for the reader
+      return -1;
+    }
+    if (parsed && config.isObject()) {
       for (const Json::Value& name : config["user_defined_names"]) {
         if (name.isString()) customNames_.insert(Lower(name.asString()));
       }
@@ -144,7 +150,7 @@ class Engine {
         control_(control),
         task_(plan.task),
         placer_(destinationRoot, control,
-                [this](const std::string& shown) { Skip(shown, "a file of that name appeared at the destination"); }),
+                [this](const std::string& shown, const std::string& why) { Skip(shown, why); }),
         sourceShown_(plovod::SourceShown(plan)),
         destinationShown_(plovod::DestinationShown(plan)) {}
 
@@ -156,7 +162,7 @@ class Engine {
       return P_ERR_FILE_OPERATION;
     }
     Walk();
-    int error = control_.Cancelled() ? control_.Reason() : 0;
+    int error = control_.Cancelled() ? control_.Reason() : rootUnreadable_ ? P_ERR_SOURCE_ROOT_MISSING : 0;
     if (error == 0) {
       error = task_.copy_strategy == 1 ? Versioning() : task_.copy_strategy == 2 ? Mirror() : Incremental();
     }
@@ -170,8 +176,10 @@ class Engine {
     if (error == 0 && task_.copy_strategy == 1 && task_.enable_rotation) Rotate();
     // A version that did not finish is no snapshot of the source: renamed
     // so that neither a later run links to it nor rotation counts it.
-    if (error != 0 && !version_.empty()) {
-      renameat(destination_, version_.c_str(), destination_, (version_ + ".incomplete").c_str());
+    if (error != 0 && !version_.empty() &&
+        renameat(destination_, version_.c_str(), destination_, (version_ + ".incomplete").c_str()) != 0) {
+      PLOVO_LOG(LOG_WARNING, "task %lu: version %s cut short and not marked: %s", plan_.id, version_.c_str(),
+                strerror(errno));
     }
     if (control_.stats.skipped > kMaxSkipRows) {
       Log(Event::kFileSkipped, {sourceShown_, std::to_string(control_.stats.skipped - kMaxSkipRows) +
@@ -184,8 +192,10 @@ class Engine {
   void Log(Event event, const std::vector<std::string>& params, int error = 0) {
     if (plan_.log != nullptr) plan_.log->Add(plan_.id, event, params, error);
   }
-  void Skip(const std::string& shown, const std::string& why) {
-    if (++control_.stats.skipped <= kMaxSkipRows) Log(Event::kFileSkipped, {shown, why});
+  // A file not copied: its row, up to the cap.
+  void Skip(const std::string& shown, const std::string& why) { Skipped(Event::kFileSkipped, {shown, why}); }
+  void Skipped(Event event, const std::vector<std::string>& params) {
+    if (++control_.stats.skipped <= kMaxSkipRows) Log(event, params);
   }
   // A destination folder that cannot be made: the run ends only when the
   // disk is full; otherwise the file has its row and the run goes on.
@@ -216,6 +226,7 @@ class Engine {
       std::vector<std::string> names;
       if (!dir || !ListNames(dir->get(), names)) {
         walkIncomplete_ = true;
+        if (folder.empty()) rootUnreadable_ = true;
         Skip(SourceShown(folder), std::string("the folder cannot be read: ") + strerror(errno));
         continue;
       }
@@ -294,13 +305,11 @@ class Engine {
   bool FatRefuses(const SourceFile& file, const std::string& destinationPath) {
     if (!plan_.destination_fat) return false;
     if (file.st.st_size > kFatLargest) {
-      ++control_.stats.skipped;
-      Log(Event::kFileTooLarge, {SourceShown(file.Path()), std::to_string(file.st.st_size)});
+      Skipped(Event::kFileTooLarge, {SourceShown(file.Path()), std::to_string(file.st.st_size)});
       return true;
     }
     if (FatPath(destinationPath)) return false;
-    ++control_.stats.skipped;
-    Log(Event::kNameNotAllowed, {SourceShown(file.Path())});
+    Skipped(Event::kNameNotAllowed, {SourceShown(file.Path())});
     return true;
   }
 
@@ -345,10 +354,17 @@ class Engine {
         previousTime = t;
       }
     }
-    for (int sequence = 1;; ++sequence) {
-      version_ = VersionName(plan_.started, sequence);
-      if (mkdirat(destination_, version_.c_str(), 0755) == 0) break;
-      if (errno != EEXIST) return errno == ENOSPC || errno == EDQUOT ? P_ERR_DEST_QUOTA_FULL : P_ERR_FILE_OPERATION;
+    for (int sequence = 1; version_.empty(); ++sequence) {
+      const std::string name = VersionName(plan_.started, sequence);
+      // Nor the name a run cut short at this time took: its mark could
+      // not be put on a second one.
+      struct stat st {};
+      if (fstatat(destination_, (name + ".incomplete").c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0) continue;
+      if (mkdirat(destination_, name.c_str(), 0755) == 0) {
+        version_ = name;
+      } else if (errno != EEXIST) {
+        return errno == ENOSPC || errno == EDQUOT ? P_ERR_DEST_QUOTA_FULL : P_ERR_FILE_OPERATION;
+      }
     }
     Folder version = OpenBelow(destination_, version_, false);
     Folder before = previous.empty() ? nullptr : OpenBelow(destination_, previous, false);
@@ -497,7 +513,7 @@ class Engine {
   }
 
   int Incremental() {
-    if (memory_.Open(plan_.task_folder + "/file-db.sqlite") != 0 || memory_.Load(known_) != 0 ||
+    if (memory_.Open(plan_.task_folder + "/file-db.sqlite") != 0 || memory_.Load(known_, copies_) != 0 ||
         memory_.Begin() != 0) {
       Log(Event::kFileSkipped, {plan_.task_folder + "/file-db.sqlite", "the task's memory cannot be read"});
       return P_ERR_FILE_OPERATION;
@@ -527,7 +543,11 @@ class Engine {
       const bool standing = fstatat(to->get(), name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0;
       bool replace = false;
       if (standing || claimed_.count(Join(folder, name)) != 0) {
-        if (task_.conflict_policy == 2 && !(standing && S_ISDIR(st.st_mode))) {
+        // Overwrite never replaces the copy of another source: with the
+        // sources moved off the card it may be the only one left.
+        auto copied = copies_.find("/" + Join(folder, name));
+        const bool another = standing && copied != copies_.end() && copied->second != key;
+        if (task_.conflict_policy == 2 && !(standing && S_ISDIR(st.st_mode)) && !another) {
           replace = true;
         } else if ((name = FreeName(to->get(), folder, name)).empty()) {
           Skip(SourceShown(file.Path()), "no free name at the destination");
@@ -594,10 +614,12 @@ class Engine {
   FileMemory memory_;
   bool memoryOpen_ = false;
   std::unordered_map<std::string, FileMemory::Known> known_;
+  std::unordered_map<std::string, std::string> copies_;  // destination path -> its source path
   std::unordered_set<std::string> claimed_;
   std::unordered_map<std::string, size_t> lastWriter_;
   std::vector<std::pair<size_t, std::string>> removals_;
   bool walkIncomplete_ = false;  // a folder could not be read
+  bool rootUnreadable_ = false;  // the source folder itself could not
 };
 
 }  // namespace

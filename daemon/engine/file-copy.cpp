@@ -75,7 +75,7 @@ int RemoveEntry(int folder, const std::string& name, int depth) {
   return result;
 }
 
-Placer::Placer(int destinationRoot, RunControl& control, std::function<void(const std::string& shown)> dropped)
+Placer::Placer(int destinationRoot, RunControl& control, Dropped dropped)
     : root_(destinationRoot), control_(control), dropped_(std::move(dropped)) {}
 
 int Placer::Transfer(int in, int out, bool& fromSource) {
@@ -188,8 +188,14 @@ int Placer::Commit() {
       continue;
     }
     // A file that appeared under the name meanwhile is the user's: kept.
-    if (errno == EEXIST) dropped_(file.shown);
-    else result = P_ERR_FILE_OPERATION;
+    // A name the destination refuses concerns this file alone.
+    if (errno == EEXIST) {
+      dropped_(file.shown, "a file of that name appeared at the destination");
+    } else if (RefusedByDestination(errno)) {
+      dropped_(file.shown, std::string("the destination refuses the name: ") + strerror(errno));
+    } else {
+      result = P_ERR_FILE_OPERATION;
+    }
     unlinkat(folder, temporary, 0);
   }
   return result;

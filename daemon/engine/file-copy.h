@@ -49,9 +49,11 @@ class Placer {
   // How Copy ended for one file.
   enum Outcome { kCopied, kSkipped, kFailed };
 
-  // dropped is called with a file's shown path when a file of its name
-  // appeared at the destination meanwhile and was kept instead.
-  Placer(int destinationRoot, RunControl& control, std::function<void(const std::string& shown)> dropped);
+  // dropped is called with a file's shown path and why when it could not
+  // be put in place: a file of its name appeared at the destination
+  // meanwhile (and was kept), or the destination refuses its name.
+  using Dropped = std::function<void(const std::string& shown, const std::string& why)>;
+  Placer(int destinationRoot, RunControl& control, Dropped dropped);
   ~Placer() { Discard(); }
   Placer(const Placer&) = delete;
   Placer& operator=(const Placer&) = delete;
@@ -91,7 +93,7 @@ class Placer {
 
   int root_;
   RunControl& control_;
-  std::function<void(const std::string& shown)> dropped_;
+  Dropped dropped_;
   std::vector<Waiting> waiting_;
   unsigned long long waitingBytes_ = 0;
   std::vector<char> buffer_;

@@ -57,10 +57,12 @@ int FileMemory::Open(const std::string& path) {
   return 0;
 }
 
-int FileMemory::Load(std::unordered_map<std::string, Known>& known) {
+int FileMemory::Load(std::unordered_map<std::string, Known>& known,
+                     std::unordered_map<std::string, std::string>& copies) {
   sqlite3_stmt* raw = nullptr;
   // In row order, so that the last copy of a path is the one remembered.
-  if (sqlite3_prepare_v2(db_, "SELECT source_path, size, mtime FROM file_info_table ORDER BY id", -1, &raw,
+  if (sqlite3_prepare_v2(db_, "SELECT source_path, size, mtime, destination_path FROM file_info_table ORDER BY id", -1,
+                         &raw,
                          nullptr) != SQLITE_OK) {
     PLOVO_LOG(LOG_ERR, "file memory: %s", sqlite3_errmsg(db_));
     return -1;
@@ -69,7 +71,10 @@ int FileMemory::Load(std::unordered_map<std::string, Known>& known) {
   int rc;
   while ((rc = sqlite3_step(raw)) == SQLITE_ROW) {
     const char* source = reinterpret_cast<const char*>(sqlite3_column_text(raw, 0));
-    if (source != nullptr) known[source] = {sqlite3_column_int64(raw, 1), sqlite3_column_int64(raw, 2)};
+    const char* destination = reinterpret_cast<const char*>(sqlite3_column_text(raw, 3));
+    if (source == nullptr || destination == nullptr) continue;
+    known[source] = {sqlite3_column_int64(raw, 1), sqlite3_column_int64(raw, 2)};
+    copies[destination] = source;
   }
   if (rc == SQLITE_DONE) return 0;
   PLOVO_LOG(LOG_ERR, "file memory: %s", sqlite3_errmsg(db_));

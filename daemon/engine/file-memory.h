@@ -32,8 +32,9 @@ class FileMemory {
   // Opens (creating when absent) the database and its table and indexes;
   // an older table without the time columns gets them. 0 or -1 (logged).
   int Open(const std::string& path);
-  // Every remembered source path with the last size and time copied.
-  int Load(std::unordered_map<std::string, Known>& known);
+  // Every remembered source path with the last size and time copied, and
+  // every destination path with the source last copied there.
+  int Load(std::unordered_map<std::string, Known>& known, std::unordered_map<std::string, std::string>& copies);
   // Remembers one copy. Rows are written in one transaction per batch:
   // Begin, Remember..., End. 0 or -1 (logged).
   int Begin();

@@ -383,4 +383,30 @@ TEST_F(EngineTest, HostileTreesCostNothingElse) {
   EXPECT_EQ(ReadFile("/volume1/photo/ver/" + plovod::VersionName(kStart, 2) + ".incomplete/a.jpg"), "a");
 }
 
+// Overwrite never replaces the copy of another source: with the sources
+// moved off the card it may be the only one left. A task turned to
+// another source forgets what it copied from the first.
+TEST_F(EngineTest, IncrementalMemoryFollowsItsSource) {
+  WriteFile("/usbshare1/DCIM/100/IMG_0001.JPG", "first");
+  PObject flat = With(With(AddTaskRequest("Flat"), "copy_strategy", Num(3)), "keep_dir_structure", Num(0));
+  flat = With(With(flat, "conflict_policy", Num(2)), "remove_src_file", Num(1));
+  const unsigned long id = Add(flat);
+  EXPECT_EQ(RunTask(id), 0);
+  WriteFile("/usbshare1/DCIM/101/IMG_0001.JPG", "second");  // the camera's numbers started again
+  EXPECT_EQ(RunTask(id), 0);
+  EXPECT_EQ(Files("/volume1/photo/card"), (Tree{{"IMG_0001.JPG", "first"}, {"IMG_0001 (1).JPG", "second"}}));
+  EXPECT_EQ(Files("/usbshare1/DCIM"), Tree{});
+
+  for (const char* folder : {"/usbshare1/DCIM/a.jpg", "/usbshare1/DCIM2/a.jpg"}) {
+    WriteFile(folder, "same");
+    Touch(folder, kStart);
+  }
+  EXPECT_EQ(RunTask(id), 0);
+  const PObject moved = With(With(flat, "action", "set_task_setting"), "usb_folder_path", "/DCIM2");
+  ASSERT_TRUE(Ok(With(moved, "task_id", Num(id))));
+  EXPECT_EQ(RunTask(id), 0);
+  EXPECT_EQ(ReadFile("/volume1/photo/card/a.jpg"), "same");
+  EXPECT_EQ(Files("/usbshare1/DCIM2"), Tree{});  // copied (over a.jpg, its own earlier name) and moved
+}
+
 }  // namespace
