@@ -186,4 +186,64 @@ benchmark::internal::Benchmark* RegisterRepeated(const char* name, void (*fn)(be
       ->Unit(unit);
 }
 
+std::vector<size_t> MixedSizes(size_t count, uint64_t total) {
+  const size_t mean = total / count;
+  std::vector<size_t> sizes(count);
+  uint64_t x = 0x2545F4914F6CDD1Dull;
+  for (size_t i = 0; i + 1 < count; i += 2) {
+    x ^= x << 13;
+    x ^= x >> 7;
+    x ^= x << 17;
+    const size_t delta = x % (mean / 2);
+    sizes[i] = mean + delta;
+    sizes[i + 1] = mean - delta;
+  }
+  sizes.back() += total - mean * count;
+  return sizes;
+}
+
+namespace {
+
+uint64_t gCountedFiles = 0, gCountedBytes = 0;  // nftw's callbacks take no context
+
+int CountEntry(const char*, const struct stat* st, int type, struct FTW*) {
+  if (type == FTW_F) {
+    ++gCountedFiles;
+    gCountedBytes += static_cast<uint64_t>(st->st_size);
+  }
+  return 0;
+}
+
+int DropEntry(const char* path, const struct stat*, int type, struct FTW*) {
+  if (type != FTW_F) return 0;
+  const int fd = open(path, O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return 0;
+  posix_fadvise(fd, 0, 0, POSIX_FADV_DONTNEED);
+  close(fd);
+  return 0;
+}
+
+}  // namespace
+
+void CountTree(const std::string& dir, uint64_t& files, uint64_t& bytes) {
+  gCountedFiles = gCountedBytes = 0;
+  nftw(dir.c_str(), CountEntry, 16, FTW_PHYS);
+  files = gCountedFiles;
+  bytes = gCountedBytes;
+}
+
+void DropFromCache(const std::string& dir) { nftw(dir.c_str(), DropEntry, 16, FTW_PHYS); }
+
+std::vector<char> RandomPool(size_t bytes) {
+  std::vector<char> pool(bytes);
+  uint64_t x = 0x9E3779B97F4A7C15ull;
+  for (size_t i = 0; i + sizeof x <= bytes; i += sizeof x) {
+    x ^= x << 13;
+    x ^= x >> 7;
+    x ^= x << 17;
+    std::memcpy(pool.data() + i, &x, sizeof x);
+  }
+  return pool;
+}
+
 }  // namespace plovo_bench

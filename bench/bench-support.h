@@ -57,6 +57,22 @@ std::string DataDir(const Sandbox& sandbox, const std::string& name);
 // then reads it through once so that it sits in the page cache.
 void PrepareRandomFile(const std::string& path, uint64_t size);
 
+// count file sizes for a tree of exactly total bytes: between half and one
+// and a half times the mean, pseudo-random but the same in every run, in
+// pairs that sum to twice the mean; the last takes the rest. count even.
+std::vector<size_t> MixedSizes(size_t count, uint64_t total);
+
+// bytes (a multiple of 8) of pseudo-random bytes, the same in every run:
+// the contents the tree benchmarks' files are cut from.
+std::vector<char> RandomPool(size_t bytes);
+
+// The count and bytes of the regular files below dir (links not followed).
+void CountTree(const std::string& dir, uint64_t& files, uint64_t& bytes);
+
+// Drops the regular files below dir from the page cache (their clean pages
+// only: sync first), so that the next reader reads them from the disk.
+void DropFromCache(const std::string& dir);
+
 // Whether the two files hold the same bytes.
 bool SameContent(const std::string& a, const std::string& b);
 

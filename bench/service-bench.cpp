@@ -171,31 +171,13 @@ std::string TreeFile(const std::string& repo, int dir, int file) {
   return repo + "/task/" + std::to_string(dir + 1) + "/" + std::to_string(file) + ".bin";
 }
 
-// The sizes vary between half and one and a half times the mean; they come
-// in pairs that sum to twice the mean, and the last file takes the rest, so
-// the tree holds exactly kTreeBytes.
-std::vector<size_t> Sizes() {
-  const size_t count = kDirs * kFilesPerDir, mean = kTreeBytes / count;
-  std::vector<size_t> sizes(count);
-  uint64_t x = 0x2545F4914F6CDD1Dull;
-  for (size_t i = 0; i < count; i += 2) {
-    x ^= x << 13;
-    x ^= x >> 7;
-    x ^= x << 17;
-    const size_t delta = x % (mean / 2);
-    sizes[i] = mean + delta;
-    sizes[i + 1] = mean - delta;
-  }
-  sizes.back() += kTreeBytes - mean * count;
-  return sizes;
-}
 
 // Where in the pool a file's bytes start.
 size_t PoolOffset(size_t index, size_t size) { return index * 7919 % (kPoolBytes - size); }
 
 void WriteTree(const std::string& repo) {
   plovo_bench::MakeDirs(repo + "/db");
-  const std::vector<size_t> sizes = Sizes();
+  const std::vector<size_t> sizes = plovo_bench::MixedSizes(kDirs * kFilesPerDir, kTreeBytes);
   for (int d = 0; d < kDirs; ++d) {
     plovo_bench::MakeDirs(repo + "/task/" + std::to_string(d + 1));
     for (int f = 0; f < kFilesPerDir; ++f) {
@@ -211,7 +193,7 @@ void WriteTree(const std::string& repo) {
 
 // "" when the tree at repo holds every file with its bytes.
 std::string CheckContent(const std::string& repo) {
-  const std::vector<size_t> sizes = Sizes();
+  const std::vector<size_t> sizes = plovo_bench::MixedSizes(kDirs * kFilesPerDir, kTreeBytes);
   std::vector<char> buffer(kPoolBytes);
   for (int d = 0; d < kDirs; ++d) {
     for (int f = 0; f < kFilesPerDir; ++f) {
@@ -228,39 +210,20 @@ std::string CheckContent(const std::string& repo) {
   return "";
 }
 
-// Files and bytes under the tree nftw walks.
-uint64_t gWalkFiles = 0, gWalkBytes = 0;
-int CountEntry(const char*, const struct stat* st, int type, struct FTW*) {
-  if (type == FTW_F) {
-    ++gWalkFiles;
-    gWalkBytes += static_cast<uint64_t>(st->st_size);
-  }
-  return 0;
-}
-
-int DropEntry(const char* path, const struct stat*, int type, struct FTW*) {
-  if (type != FTW_F) return 0;
-  const int fd = open(path, O_RDONLY | O_CLOEXEC);
-  if (fd < 0) return 0;
-  posix_fadvise(fd, 0, 0, POSIX_FADV_DONTNEED);
-  close(fd);
-  return 0;
-}
-
 // Untimed, before every move: the previous move's copy goes to the disk,
 // and the source's pages leave the page cache (clean pages only, hence the
 // sync first).
 void Settle() {
   sync();
-  nftw((gVolume[gAt] + "/@Plovo").c_str(), DropEntry, 16, FTW_PHYS);
+  plovo_bench::DropFromCache(gVolume[gAt] + "/@Plovo");
 }
 
 // "" when the whole tree is on the volume gAt names and nothing of it is
 // left on the other one (neither the repository nor its staging copy).
 std::string CheckPlace() {
-  gWalkFiles = gWalkBytes = 0;
-  nftw((gVolume[gAt] + "/@Plovo").c_str(), CountEntry, 16, FTW_PHYS);
-  if (gWalkFiles != kDirs * kFilesPerDir || gWalkBytes != kTreeBytes) return "the tree is not whole after the move";
+  uint64_t files = 0, bytes = 0;
+  plovo_bench::CountTree(gVolume[gAt] + "/@Plovo", files, bytes);
+  if (files != kDirs * kFilesPerDir || bytes != kTreeBytes) return "the tree is not whole after the move";
   const std::string& other = gVolume[1 - gAt];
   if (Exists(other + "/@Plovo") || Exists(other + "/@tmp/@Plovo")) return "the old tree is still there";
   return "";
@@ -333,14 +296,7 @@ int main(int argc, char** argv) {
   }
   MakeSandbox();
 
-  gPool.resize(kPoolBytes);
-  uint64_t x = 0x9E3779B97F4A7C15ull;
-  for (size_t i = 0; i < kPoolBytes; i += sizeof x) {
-    x ^= x << 13;
-    x ^= x >> 7;
-    x ^= x << 17;
-    std::memcpy(gPool.data() + i, &x, sizeof x);
-  }
+  gPool = plovo_bench::RandomPool(kPoolBytes);
   const double start = Now();
   WriteTree(gVolume[0] + "/@Plovo");
   sync();

@@ -175,22 +175,10 @@ std::string NasPath(const TaskDB::TaskInfo& info) {
 
 bool IsExport(const TaskDB::TaskInfo& info) { return info.task_type == 2; }
 
-// A folder as "/a/b", without empty components; "" for the root.
-std::string Normalized(const std::string& folder) {
-  std::string result;
-  for (size_t begin = 0; begin < folder.size();) {
-    size_t end = folder.find('/', begin);
-    if (end == std::string::npos) end = folder.size();
-    if (end > begin) result += "/" + folder.substr(begin, end - begin);
-    begin = end + 1;
-  }
-  return result;
-}
-
 // The side a task copies from: its direction and folder.
 std::string SourceOf(const TaskDB::TaskInfo& info) {
-  return IsExport(info) ? "nas:" + info.nas_share_name + Normalized(info.nas_folder_path)
-                        : "usb:" + Normalized(info.usb_folder_path);
+  return IsExport(info) ? "nas:" + info.nas_share_name + NormalizedFolder(info.nas_folder_path)
+                        : "usb:" + NormalizedFolder(info.usb_folder_path);
 }
 
 // Where a share really is; "" when it is not there.
@@ -495,8 +483,8 @@ Code Daemon::StartRun(const StoredTask& task, std::string& why) {
   if (share.empty()) return kShareAbsent;
   const std::string card = RealPath(device.share_path);
   if (card.empty()) return kDeviceAbsent;
-  const std::string usb = Under(card, Normalized(info.usb_folder_path));
-  const std::string nas = Under(share, Normalized(info.nas_folder_path));
+  const std::string usb = Under(card, NormalizedFolder(info.usb_folder_path));
+  const std::string nas = Under(share, NormalizedFolder(info.nas_folder_path));
   // A copy into its own source would copy its copies, without end.
   if (Inside(usb, nas) || Inside(nas, usb)) {
     why = "the source and the destination overlap";

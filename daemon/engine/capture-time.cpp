@@ -49,28 +49,18 @@ bool HasExtension(const std::string& name, const char* const (&extensions)[N]) {
   return false;
 }
 
-// The n decimal digits at text, or -1 when any of them is not a digit.
-int Digits(const char* text, int n) {
-  int value = 0;
-  for (int i = 0; i < n; ++i) {
-    if (text[i] < '0' || text[i] > '9') return -1;
-    value = value * 10 + (text[i] - '0');
-  }
-  return value;
-}
-
 // "YYYY:MM:DD HH:MM:SS" as calendar fields. A camera whose clock was never
 // set writes zeros or blanks there; those, and any field out of its range,
 // are not a date.
 bool ParseExifDate(const char* text, std::tm& taken) {
   if (text[4] != ':' || text[7] != ':' || text[10] != ' ' || text[13] != ':' || text[16] != ':') return false;
   std::tm t{};
-  t.tm_year = Digits(text, 4) - 1900;
-  t.tm_mon = Digits(text + 5, 2) - 1;
-  t.tm_mday = Digits(text + 8, 2);
-  t.tm_hour = Digits(text + 11, 2);
-  t.tm_min = Digits(text + 14, 2);
-  t.tm_sec = Digits(text + 17, 2);
+  t.tm_year = plovod::DecimalDigits(text, 4) - 1900;
+  t.tm_mon = plovod::DecimalDigits(text + 5, 2) - 1;
+  t.tm_mday = plovod::DecimalDigits(text + 8, 2);
+  t.tm_hour = plovod::DecimalDigits(text + 11, 2);
+  t.tm_min = plovod::DecimalDigits(text + 14, 2);
+  t.tm_sec = plovod::DecimalDigits(text + 17, 2);
   // Year 0, not digits, or a clock never set: such a date would make no
   // date folder that sorts with the others.
   if (t.tm_year < 1970 - 1900) return false;
@@ -97,6 +87,15 @@ std::string Format(const std::tm& taken, const char* format) {
 }  // namespace
 
 namespace plovod {
+
+int DecimalDigits(const char* text, int n) {
+  int value = 0;
+  for (int i = 0; i < n; ++i) {
+    if (text[i] < '0' || text[i] > '9') return -1;
+    value = value * 10 + (text[i] - '0');
+  }
+  return value;
+}
 
 bool IsPhoto(const std::string& name) { return HasExtension(name, kPhotoExtensions); }
 

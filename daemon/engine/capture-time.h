@@ -28,6 +28,10 @@ bool ExifCaptureTime(int fd, std::tm& taken);
 // local time.
 std::tm CaptureTime(int folder, const std::string& name, time_t mtime);
 
+// The n decimal digits at text as a number, or -1 when any of them is not
+// a digit: the fields of the dates in EXIF blocks and version names.
+int DecimalDigits(const char* text, int n);
+
 // "2026-11-23", the date folder of a capture time.
 std::string DateFolderName(const std::tm& taken);
 // "20261123_143005" followed by the name's own extension (".JPG" stays

@@ -1,5 +1,7 @@
 #include "daemon/engine/rotation.h"
 
+#include "daemon/engine/capture-time.h"
+
 #include <algorithm>
 #include <utility>
 
@@ -8,16 +10,6 @@ namespace {
 constexpr time_t kDay = 86400;
 constexpr time_t kMonth = 30 * kDay;
 constexpr time_t kWeek = 7 * kDay;
-
-// The n decimal digits at text, or -1 when any of them is not a digit.
-int Digits(const char* text, int n) {
-  int value = 0;
-  for (int i = 0; i < n; ++i) {
-    if (text[i] < '0' || text[i] > '9') return -1;
-    value = value * 10 + (text[i] - '0');
-  }
-  return value;
-}
 
 // Which stretch of the history a version of this age falls in, as (tier,
 // step): the last day keeps every version, so each gets a step of its own
@@ -52,12 +44,12 @@ bool ParseVersionName(const std::string& name, time_t& started) {
   }
   const char* text = name.c_str();
   std::tm t{};
-  t.tm_year = Digits(text, 4) - 1900;
-  t.tm_mon = Digits(text + 5, 2) - 1;
-  t.tm_mday = Digits(text + 8, 2);
-  t.tm_hour = Digits(text + 11, 2);
-  t.tm_min = Digits(text + 13, 2);
-  t.tm_sec = Digits(text + 15, 2);
+  t.tm_year = DecimalDigits(text, 4) - 1900;
+  t.tm_mon = DecimalDigits(text + 5, 2) - 1;
+  t.tm_mday = DecimalDigits(text + 8, 2);
+  t.tm_hour = DecimalDigits(text + 11, 2);
+  t.tm_min = DecimalDigits(text + 13, 2);
+  t.tm_sec = DecimalDigits(text + 15, 2);
   if (t.tm_year < 1 - 1900) return false;  // year 0, or not digits
   // Out-of-range fields move into the next one (month 13 becomes January),
   // so fields that come back changed were not a date. UTC here, so that a

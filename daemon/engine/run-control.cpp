@@ -19,19 +19,20 @@ std::string RunControl::Copying() const {
   return copying_;
 }
 
-namespace {
-
-// "/<share>" and the folder without empty components ("/" adds nothing).
-std::string Shown(const std::string& share, const std::string& folder) {
-  std::string shown = "/" + share;
+std::string NormalizedFolder(const std::string& folder) {
+  std::string result;
   for (size_t begin = 0; begin < folder.size();) {
     size_t end = folder.find('/', begin);
     if (end == std::string::npos) end = folder.size();
-    if (end > begin) shown += "/" + folder.substr(begin, end - begin);
+    if (end > begin) result += "/" + folder.substr(begin, end - begin);
     begin = end + 1;
   }
-  return shown;
+  return result;
 }
+
+namespace {
+
+std::string Shown(const std::string& share, const std::string& folder) { return "/" + share + NormalizedFolder(folder); }
 
 }  // namespace
 

@@ -59,6 +59,10 @@ class RunControl {
   std::string copying_;
 };
 
+// A folder of a share as "/a/b", without empty components; "" for the
+// share's root.
+std::string NormalizedFolder(const std::string& folder);
+
 // A run's folders as the page shows them: "/<share>/<folder>", the share
 // being the device's or the NAS share by the task's direction.
 std::string SourceShown(const RunPlan& plan);
